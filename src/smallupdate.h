@@ -1,0 +1,82 @@
+// SmallUpdate: the record of one small update (hot-fix) and the operations that carry it
+// from discovery to installation: its info file, the download status writer, the apply
+// status file, and the flash, unpack, configuration and package steps.
+#ifndef KYTOINSTALLCPP_SMALLUPDATE_H
+#define KYTOINSTALLCPP_SMALLUPDATE_H
+
+#include <string>
+#include <vector>
+
+#include <kytoplatform/kytoconf.h>
+
+class SmallUpdate {
+public:
+    // Download state, written as a number into "/var/run/downloadVYX.status".
+    enum DOWNLOAD_STATUS {
+        DOWNLOAD_STATUS_NONE = 0,
+        DOWNLOAD_STATUS_INIT = 1,
+        DOWNLOAD_STATUS_DOWNLOADING = 2,
+        DOWNLOAD_STATUS_FINISHED = 3,
+        DOWNLOAD_STATUS_FAILED = 4,
+        DOWNLOAD_STATUS_STOPPED = 5,
+    };
+
+    // Apply stage, written as a number into "/var/run/applySmallUpd@te.status".
+    enum APPLY_STAGE {
+        APPLY_STAGE_NONE = 0,
+        APPLY_STAGE_WAITING_REMOTE_UPGRADING = 1,
+        APPLY_STAGE_ANALYING = 2,
+        APPLY_STAGE_PROGRAM = 3,
+        APPLY_STAGE_START_SERVICE = 4,
+        APPLY_STAGE_FINISHED = 5,
+        APPLY_STAGE_REBOOT = 6,
+    };
+
+    SmallUpdate();
+    explicit SmallUpdate(const std::string& unique);
+
+    // ---- Record and info file ----
+    int GetErrno();
+    bool Equal(const SmallUpdate& other) const;
+    bool ImportInfoFile(const char* path);
+    bool DumpToInfoFile(bool blPassive);
+
+    // ---- Download status file (writer) ----
+    static int UpdateDownloadProgress(int percentage, DOWNLOAD_STATUS status);
+
+    // ---- Apply status file ----
+    static bool UpdateApplyProgress(int percentage, APPLY_STAGE stage, const std::string& errMsg);
+    void HASetApplyProgressErr(const std::string& errMsg) const;
+    static void GetApplyStage(int& percentage, std::string& stage, std::string& errMsg);
+
+    // ---- Unpack and install ----
+    bool UpdateFlash() const;
+    bool UnpackSmallUpdate() const;
+    bool UpdateConfig() const;
+    bool InstallDeb(int startPercentage, APPLY_STAGE stage);
+    bool GetSourceDir(std::string& folder, const std::string& name);
+    static bool FilesExist(const std::string& folder, const std::string& name);
+    static bool FilesExist(const std::string& folder, const std::vector<std::string>& names);
+
+    // The record.
+    int m_errno;
+    KytoConf m_conf;
+    std::string m_unique;
+    int m_newSmallFixNumber;
+    int m_buildNumber;
+    bool m_blConfigUpdate;
+    bool m_blFlashUpdate;
+    std::string m_debDir;
+    std::string m_smallUpdateDeb;
+    std::string m_smallUpdateDebLink;
+    std::string m_flashUpdateDeb;
+    std::string m_flashUpdateDebLink;
+    std::vector<std::string> m_installDebs;
+    std::vector<std::string> m_installDebLinks;
+    bool m_blRestartAllService;
+    bool m_blNeedReboot;
+    std::vector<std::string> m_vyxServiceRestartList;
+    std::vector<std::string> m_pkgRestartList;
+};
+
+#endif

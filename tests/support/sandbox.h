@@ -1,0 +1,109 @@
+// Shared test helpers for code that runs inside the sandbox (tests/sandbox/kyto-sandbox):
+// syslog lines caught at /dev/log, files, key=value files, tmpfs data volumes, child
+// processes, and the calls recorded by the provisioned fake programs.
+//
+// The sandbox is provisioned (tests/sandbox/provision.sh) with:
+//   /etc.defaults/VERSION        majorversion="5" minorversion="2" buildphase="GM"
+//                                buildnumber="5644" builddate="2026/10/01" (no smallfixnumber)
+//   /etc.defaults/kytoinfo.conf  unique="demo_model" timezone="Europe/Berlin"
+//                                supportraid="no" support_buildin_storage="no" maxdisks="4"
+//   /usr/kyto/bin/wget, /usr/kyto/bin/openssl   symbolic links to the real tools
+//   /usr/kyto/bin/kytovyxnotify, /usr/kyto/bin/kytopkg and the start-up scripts
+//   /usr/kyto/etc/rc.d/S01iptables.sh S20samba.sh S99sshd.sh: recording scripts that
+//   append one line per call to /var/log/kyto-calls.log (see RecordedCalls).
+// No data volume is mounted, no HA state file, no /autoupd@te.info.
+#ifndef KYTO_TESTS_SUPPORT_SANDBOX_H
+#define KYTO_TESTS_SUPPORT_SANDBOX_H
+
+#include <sys/types.h>
+
+#include <functional>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+namespace kytotest {
+
+// ---- Sandbox ----------------------------------------------------------------------------
+
+// True when this process runs inside a kyto-sandbox root (marker file and overlay root).
+bool InSandbox();
+
+// Base fixture of every test that touches a fixed path.  SetUp fails the test unless it
+// runs in the sandbox, and notes the open descriptors; TearDown fails the test when a
+// descriptor was leaked or a child process is left behind.
+class SandboxTest : public ::testing::Test {
+protected:
+    void SetUp() override;
+    void TearDown() override;
+
+private:
+    std::vector<int> fds_at_start_;
+};
+
+// ---- Syslog -----------------------------------------------------------------------------
+
+struct LogLine {
+    int priority = -1;  // LOG_ERR, LOG_INFO, ... (facility stripped)
+    std::string tag;     // ident as sent ("program[pid]")
+    std::string message; // text after the "tag: " prefix
+};
+// Every line the syslog catcher received so far, in order.  Waits until everything sent
+// before the call has been written (a marker line is sent and waited for).
+std::vector<LogLine> SyslogLines();
+// Messages only, optionally limited to one priority (-1: all).
+std::vector<std::string> SyslogMessages(int priority = -1);
+// True when some message contains the text.
+bool SyslogContains(const std::string& text, int priority = -1);
+// Forgets the lines received so far (later calls only see newer lines).
+void ClearSyslog();
+
+// ---- Files ------------------------------------------------------------------------------
+
+std::optional<std::string> ReadFile(const std::string& path);
+// Writes content (creating parent folders), replacing the file; mode applied.
+void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644);
+bool PathExists(const std::string& path);  // lstat succeeds
+bool IsDirectory(const std::string& path);
+void RemoveTree(const std::string& path);
+std::vector<std::string> ListDir(const std::string& path);  // sorted names, no . and ..
+// Parses a key=value file (both line forms; quotes removed).  Empty map when missing.
+std::map<std::string, std::string> ReadKeyValueFile(const std::string& path);
+// Sets or removes (value nullopt) one key of a key=value file, writing key="value".
+void SetKeyValue(const std::string& path, const std::string& key,
+                 const std::optional<std::string>& value);
+
+// ---- Volumes ----------------------------------------------------------------------------
+
+// Mounts a tmpfs of exactly sizeBytes (rounded up to pages) at mountPoint (created), read
+// only when asked.  The data volume then has exactly that many bytes free.
+void MountVolume(const std::string& mountPoint, unsigned long long sizeBytes,
+                 bool readOnly = false);
+void UnmountVolume(const std::string& mountPoint);
+
+// ---- Processes and commands -------------------------------------------------------------
+
+// Runs fn in a forked child and returns the child's pid; the child exits with fn's result.
+pid_t Spawn(const std::function<int()>& fn);
+// Waits for pid; returns its exit status, or 128 + signal when it was killed.
+int Wait(pid_t pid);
+// Runs a shell command; returns its exit status; output (stdout+stderr) when asked.
+int Shell(const std::string& command, std::string* output = nullptr);
+// Pids of this process's children that are still alive (not yet reaped included).
+std::vector<pid_t> LiveChildren();
+// Open descriptors of this process.
+std::vector<int> OpenFds();
+
+// ---- Recorded calls of the fake appliance programs --------------------------------------
+
+// One line per call of kytovyxnotify, kytopkg or a start-up script, in call order: the
+// program's base name followed by its arguments.
+std::vector<std::vector<std::string>> RecordedCalls();
+void ClearRecordedCalls();
+
+}  // namespace kytotest
+
+#endif
