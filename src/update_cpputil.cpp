@@ -1,0 +1,283 @@
+#include "update_cpputil.h"
+
+#include <errno.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <sys/statfs.h>
+#include <sys/types.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <sstream>
+
+#include <kytoplatform/klibc.h>
+#include <kytoplatform/kyto_errors.h>
+#include <kytoplatform/kyto_system.h>
+
+#include "kyto_paths.h"
+#include "scoped.h"
+
+namespace {
+
+constexpr const char* kModule = "update_cpputil";
+
+// Reads the whole file behind f; stops quietly at a read error (a folder opened as a file
+// reads as nothing, which then fails to parse).
+std::string ReadAll(FILE* f) {
+    std::string text;
+    char buf[8192];
+    size_t n;
+    while ((n = fread(buf, 1, sizeof(buf), f)) > 0)
+        text.append(buf, n);
+    return text;
+}
+
+}  // namespace
+
+// ---- JSON files and string lists ------------------------------------------------------------
+
+int UpdateUtil::ParseJsonRootFromFile(const char* path, Json::Value& root) {
+    if (!path) {
+        syslog(LOG_ERR, "%s:%d bad parameters!", kModule, __LINE__);
+        return 0;
+    }
+    std::string text;
+    {
+        kyto::UniqueFile file(fopen(path, "re"));
+        if (!file) {
+            // A state file we cannot open is removed so that the next run starts clean.
+            unlink(path);
+            syslog(LOG_ERR, "%s:%d inFile failed\n", kModule, __LINE__);
+            return 0;
+        }
+        text = ReadAll(file.get());
+    }
+    std::istringstream stream(text);
+    Json::Reader reader;
+    if (!reader.parse(stream, root, false)) {
+        syslog(LOG_ERR, "%s:%d Parse failed\n", kModule, __LINE__);
+        unlink(path);
+        return 0;
+    }
+    return 1;
+}
+
+int UpdateUtil::DumpJsonRootToFile(const char* path, const Json::Value& root) {
+    if (!path) {
+        syslog(LOG_ERR, "%s:%d bad parameter!", kModule, __LINE__);
+        return 0;
+    }
+    Json::FastWriter writer;
+    const std::string text = writer.write(root);
+
+    // Rewritten in place: readers of these files run after the writer is done.
+    kyto::UniqueFile file(fopen(path, "we"));
+    if (!file) {
+        syslog(LOG_ERR, "%s:%d Failed to open %s", kModule, __LINE__, path);
+        return 0;
+    }
+    int ret = 1;
+    if (fwrite(text.data(), 1, text.size(), file.get()) == 0) {
+        syslog(LOG_ERR, "%s:%d Failed to write to %s", kModule, __LINE__, path);
+        ret = 0;
+    }
+    file.close();
+    return ret;
+}
+
+int UpdateUtil::JsonArray2StringVector(const Json::Value& array, std::vector<std::string>& out) {
+    if (!array.isArray()) {
+        syslog(LOG_ERR, "%s:%d bad parameter!", kModule, __LINE__);
+        out.clear();
+        return 0;
+    }
+    out.clear();
+    for (Json::ArrayIndex i = 0; i < array.size(); ++i) {
+        const Json::Value item = array[i];
+        if (!item.isString()) {
+            syslog(LOG_ERR, "%s:%d not a string", kModule, __LINE__);
+            out.clear();
+            return 0;
+        }
+        out.push_back(item.asString());
+    }
+    return 1;
+}
+
+int UpdateUtil::StringVector2JsonArray(const std::vector<std::string>& in, Json::Value& array) {
+    for (const std::string& s : in)
+        array.append(Json::Value(s));
+    return 1;
+}
+
+int UpdateUtil::CompareVector(std::vector<std::string> a, std::vector<std::string> b) {
+    if (a.size() != b.size())
+        return 0;
+    std::sort(a.begin(), a.end());
+    std::sort(b.begin(), b.end());
+    for (size_t i = 0; i < a.size(); ++i) {
+        if (a[i] != b[i])
+            return 0;
+    }
+    return 1;
+}
+
+// ---- Archives and folders -------------------------------------------------------------------
+
+int UpdateUtil::UntarFile(const char* archive, const char* folder) {
+    if (!archive || !folder) {
+        KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, __FILE__, __LINE__);
+        return 0;
+    }
+    if (KLIBCExec("/bin/tar", "xpf", archive, "-C", folder) != 0) {
+        syslog(LOG_ERR, "%s:%d failed to [tar xpf %s -C %s]", kModule, __LINE__, archive, folder);
+        return 0;
+    }
+    return 1;
+}
+
+int UpdateUtil::UntarFile(const std::string& archive, const std::string& folder) {
+    return UntarFile(archive.c_str(), folder.c_str());
+}
+
+int UpdateUtil::RemoveFolder(const char* path) {
+    // Without an operand "rm -rf" would succeed doing nothing.
+    if (!path) {
+        KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, __FILE__, __LINE__);
+        return 0;
+    }
+    return KLIBCExec("/bin/rm", "-rf", path, nullptr, nullptr) == 0 ? 1 : 0;
+}
+
+int UpdateUtil::RemoveFolder(const std::string& path) {
+    return RemoveFolder(path.c_str());
+}
+
+int UpdateUtil::CleanFolder(const char* path) {
+    if (!RemoveFolder(path))
+        return 0;
+    if (mkdir(path, 0755) != 0) {
+        // mkdir is a C library call: record it as the platform's last error so the message
+        // names this failure and not an older one.
+        KLIBCErrSetEx(KYTO_ERR_SYSTEM, __FILE__, __LINE__);
+        syslog(LOG_ERR, "%s:%d Fail to mkdir: %s, KytoErr =[0x%04X %s:%d]", kModule, __LINE__, path,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return 0;
+    }
+    return 1;
+}
+
+int UpdateUtil::CleanFolder(const std::string& path) {
+    return CleanFolder(path.c_str());
+}
+
+// ---- Volumes --------------------------------------------------------------------------------
+
+int UpdateUtil::IsThereAvailVolPath(std::string& path, unsigned long minFreeBytes, bool allowRoot) {
+    char szPath[4095] = {0};
+    bool found = false;
+
+    PKYTO_MOUNT_VOL_INFO node = KYTOMountVolInfoEnum(0);
+    for (; node; node = node->pNext) {
+        if (!node->blWritable) {
+            syslog(LOG_ERR, "%s:%d sad.. %s is not a writable volume.", kModule, __LINE__,
+                   node->szMountPath);
+            continue;
+        }
+        if (node->ullFreeBytes >= minFreeBytes) {
+            const size_t n = strnlen(node->szMountPath, sizeof(szPath) - 1);
+            memcpy(szPath, node->szMountPath, n);
+            szPath[n] = '\0';
+            found = true;
+            break;
+        }
+        syslog(LOG_ERR, "%s:%d %llu < %lu, check next volume.", kModule, __LINE__,
+               static_cast<unsigned long long>(node->ullFreeBytes), minFreeBytes);
+    }
+    // Released from the node where the walk stopped; after running off the end there is
+    // nothing left to release from.  The callers are short-lived processes.
+    KYTOMountVolInfoFree(node);
+
+    if (!found && allowRoot) {
+        struct statfs st;
+        if (statfs("/", &st) != 0) {
+            syslog(LOG_ERR, "%s:%d sad.. could not get the size of %s. reason=%s.", kModule,
+                   __LINE__, "/", strerror(errno));
+            return 0;
+        }
+        const unsigned long long avail = static_cast<unsigned long long>(st.f_bavail) *
+                                         static_cast<unsigned long long>(st.f_bsize);
+        if (avail < minFreeBytes) {
+            syslog(LOG_ERR, "%s:%d sad.. %s do not have sufficient size.", kModule, __LINE__, "/");
+            return 0;
+        }
+        snprintf(szPath, sizeof(szPath), "%s", "/");
+        found = true;
+    }
+    if (!found)
+        return 0;
+
+    syslog(LOG_INFO, "%s:%d We get %s to upgrade.", kModule, __LINE__, szPath);
+    path = szPath;
+    return 1;
+}
+
+// ---- Download kind and user agent -----------------------------------------------------------
+
+void UpdateUtil::CheckDownloadedPatchType(PATCH_TYPE& type) {
+    type = PATCH_TYPE_NONE;
+    if (!KLIBCFileExist(kyto::kAutoUpdateInfoFile))
+        return;
+
+    Json::Value root;
+    if (!ParseJsonRootFromFile(kyto::kAutoUpdateInfoFile, root)) {
+        syslog(LOG_INFO, "%s:%d [%s] does not contain correct format", kModule, __LINE__,
+               kyto::kAutoUpdateInfoFile);
+        return;
+    }
+    if (root.empty())
+        return;
+    // Only an object can carry the member; any other document is as good as unknown.
+    if (!root.isObject() || !root.isMember(kyto::kKeyUpdateType)) {
+        syslog(LOG_INFO, "%s:%d Unrecognized download info, no [%s]", kModule, __LINE__,
+               kyto::kKeyUpdateType);
+        return;
+    }
+    const Json::Value& kind = root[kyto::kKeyUpdateType];
+    type =
+        (kind.isString() && kind.asString() == kyto::kTypeVyx) ? PATCH_TYPE_VYX : PATCH_TYPE_SMALL;
+}
+
+int UpdateUtil::GetUserAgent(std::string& agent) {
+    char szUnique[128] = {0};
+    char szBuild[64] = {0};
+    char szMajor[16] = {0};
+    char szMinor[16] = {0};
+
+    if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "unique", szUnique, sizeof(szUnique), 0) < 0) {
+        syslog(LOG_ERR, "%s:%d Get unique Fail[0x%04X %s:%d]", kModule, __LINE__, KLIBCErrGet(),
+               KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return 0;
+    }
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", szBuild, sizeof(szBuild), 0) < 0) {
+        syslog(LOG_ERR, "%s:%d Get buildnumber Fail[0x%04X %s:%d]", kModule, __LINE__,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return 0;
+    }
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "majorversion", szMajor, sizeof(szMajor), 0) < 0) {
+        syslog(LOG_ERR, "%s:%d Get majorversion Fail[0x%04X %s:%d]", kModule, __LINE__,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return 0;
+    }
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "minorversion", szMinor, sizeof(szMinor), 0) < 0) {
+        syslog(LOG_ERR, "%s:%d Get minorversion Fail[0x%04X %s:%d]", kModule, __LINE__,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return 0;
+    }
+    char szAgent[512] = {0};
+    snprintf(szAgent, sizeof(szAgent), "%s VYX%s.%s %s (autoupgrade)", szUnique, szMajor, szMinor,
+             szBuild);
+    agent = szAgent;
+    return 1;
+}

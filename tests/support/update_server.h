@@ -1,0 +1,72 @@
+// A loopback update server for the tests: a separate python3 process
+// (tests/support/update_server.py) listening on 127.0.0.1 on a port chosen by the kernel
+// (port 0), serving files from a folder of its own.  It can answer any status code for a
+// path a given number of times before it answers normally, send a body slowly, and it
+// records every request (path, query, user agent, status) for the test to read back.
+#ifndef KYTO_TESTS_SUPPORT_UPDATE_SERVER_H
+#define KYTO_TESTS_SUPPORT_UPDATE_SERVER_H
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+namespace kytotest {
+
+class UpdateServer {
+  public:
+    struct Request {
+        std::string method;     // "GET", "HEAD", ...
+        std::string path;       // URL path without the query, e.g. "/autoupdate/genRSS.php"
+        std::string query;      // raw query text without '?', e.g. "tz=Europe/Berlin"
+        std::string userAgent;  // the User-Agent header ("" when absent)
+        int status = 0;         // status code answered
+    };
+
+    // Starts the server (fails the calling test with a fatal failure when it cannot) and
+    // waits until it listens.  The served folder is a fresh folder under /tmp.
+    UpdateServer();
+    // Stops the server process and reaps it.  Declare the server in the test body (or
+    // destroy it in TearDown before the base fixture's): the fixture fails a test that
+    // leaves a child process behind.
+    ~UpdateServer();
+    UpdateServer(const UpdateServer&) = delete;
+    UpdateServer& operator=(const UpdateServer&) = delete;
+
+    int Port() const { return port_; }
+    std::string BaseUrl() const;                     // "http://127.0.0.1:<port>"
+    std::string Url(const std::string& path) const;  // BaseUrl() + path (path starts with '/')
+    const std::string& Root() const { return root_; }
+
+    // Serves content at urlPath (e.g. "/autoupdate/genRSS.php", "/images/vyx.img").  The
+    // query string is ignored when matching a path.
+    void PutFile(const std::string& urlPath, const std::string& content);
+    // Serves a file of the given size with deterministic pseudo-random bytes; returns its
+    // local path (under Root()), e.g. to compute its MD5.
+    std::string PutFileOfSize(const std::string& urlPath, unsigned long long bytes);
+    // Answers `status` (with a short body) for urlPath the next `times` requests, then
+    // normally; times < 0 means always.
+    void FailPath(const std::string& urlPath, int status, int times = -1);
+    // Sends the body of urlPath at about bytesPerSecond (in small chunks, flushing each).
+    void SlowPath(const std::string& urlPath, long bytesPerSecond);
+    // Every request seen so far, in arrival order.
+    std::vector<Request> Requests() const;
+    // Requests for one path.
+    std::vector<Request> RequestsFor(const std::string& urlPath) const;
+    // Forgets the requests seen so far.
+    void ClearRequests();
+    // Points the appliance at this server: sets rss_server="<BaseUrl>/autoupdate/genRSS.php"
+    // in /etc.defaults/kytoinfo.conf.
+    void PointRssServerHere() const;
+
+  private:
+    void Start();
+
+    pid_t pid_ = -1;
+    int port_ = 0;
+    std::string root_;
+};
+
+}  // namespace kytotest
+
+#endif
