@@ -1,0 +1,125 @@
+// Internal helpers of the platform layer: error reporting, RAII owners for descriptors
+// and files, the key=value file parser and the process runner.  Not installed.
+#ifndef KYTOPLATFORM_PLATFORM_INTERNAL_H
+#define KYTOPLATFORM_PLATFORM_INTERNAL_H
+
+#include <stdio.h>
+#include <unistd.h>
+
+#include <string>
+#include <utility>
+#include <vector>
+
+#include <kytoplatform/klibc.h>
+#include <kytoplatform/kyto_errors.h>
+
+// Records code as the thread's last error, with the file and line of the failure site.
+#define KYTO_FAIL(code) KLIBCErrSetEx((code), __FILE__, __LINE__)
+
+// Internal: hidden from the library's exported symbols.
+namespace __attribute__((visibility("hidden"))) kytoplat {
+
+// Owns a file descriptor.
+class UniqueFd {
+public:
+    UniqueFd() = default;
+    explicit UniqueFd(int fd) : fd_(fd) {}
+    ~UniqueFd() { reset(); }
+    UniqueFd(const UniqueFd&) = delete;
+    UniqueFd& operator=(const UniqueFd&) = delete;
+
+    int get() const { return fd_; }
+    bool valid() const { return fd_ >= 0; }
+    int release() { return std::exchange(fd_, -1); }
+    void reset(int fd = -1) {
+        if (fd_ >= 0) ::close(fd_);
+        fd_ = fd;
+    }
+
+private:
+    int fd_ = -1;
+};
+
+// Owns a FILE* from fopen/fdopen.
+class UniqueFile {
+public:
+    explicit UniqueFile(FILE* f = nullptr) : f_(f) {}
+    ~UniqueFile() {
+        if (f_) ::fclose(f_);
+    }
+    UniqueFile(const UniqueFile&) = delete;
+    UniqueFile& operator=(const UniqueFile&) = delete;
+
+    FILE* get() const { return f_; }
+    explicit operator bool() const { return f_ != nullptr; }
+
+private:
+    FILE* f_ = nullptr;
+};
+
+// Unlinks a path when it goes out of scope, unless released.
+class ScopedUnlink {
+public:
+    explicit ScopedUnlink(std::string path) : path_(std::move(path)) {}
+    ~ScopedUnlink() {
+        if (!path_.empty()) ::unlink(path_.c_str());
+    }
+    ScopedUnlink(const ScopedUnlink&) = delete;
+    ScopedUnlink& operator=(const ScopedUnlink&) = delete;
+    void release() { path_.clear(); }
+
+private:
+    std::string path_;
+};
+
+// Snapshot of the thread's last error, put back when the keeper goes out of scope unless
+// dismissed.  Used by calls that try something whose failure is not their own failure
+// (an absent optional file, for instance), so that they leave the caller's error alone.
+class ErrorKeeper {
+public:
+    ErrorKeeper();
+    ~ErrorKeeper();
+    ErrorKeeper(const ErrorKeeper&) = delete;
+    ErrorKeeper& operator=(const ErrorKeeper&) = delete;
+    void dismiss() { active_ = false; }
+
+private:
+    bool active_ = true;
+    int code_;
+    int line_;
+    std::string file_;
+};
+
+// ---- key=value files ------------------------------------------------------------------
+
+// Reads every line of a key=value file (newlines stripped).  endsWithNewline tells whether
+// the last line was terminated.  Returns 0 ok, -1 with the last error set (missing file:
+// KYTO_ERR_FILE_NOT_FOUND; a folder or an unopenable file: KYTO_ERR_FILE_OPEN; read
+// failure: KYTO_ERR_FILE_READ; a line over KLIBC_KV_MAX_LINE: KYTO_ERR_LINE_TOO_LONG).
+int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewline);
+
+// When line is a key=value line for key, stores its value (blanks around it and one pair
+// of surrounding double quotes removed) and returns true.
+bool KvLineMatches(const std::string& line, const std::string& key, std::string* value);
+
+// Value of the first line for key.  1 found, 0 absent.
+int KvFind(const std::vector<std::string>& lines, const std::string& key, std::string* value);
+
+// Loads the file and looks key up: 1 found, 0 absent, -1 error (last error set).
+int KvGet(const char* path, const std::string& key, std::string* value);
+
+// ---- processes ------------------------------------------------------------------------
+
+// Forks and executes prog with argv (NULL-terminated, built before the fork), standard
+// input from /dev/null.  On success *pid is the child's pid and the return is 0.  When the
+// program cannot be executed the child exits with 127 and *execFailed is set (the child is
+// then already reaped only if wait was asked).  -1 when fork fails (last error set).
+int SpawnProgram(const char* prog, char* const argv[], pid_t* pid, bool* execFailed);
+
+// Waits for pid (EINTR retried).  Returns the exit status 0..255, or -1 when the wait
+// fails or the child died by a signal (last error KYTO_ERR_EXEC).
+int WaitProgram(pid_t pid);
+
+}  // namespace kytoplat
+
+#endif

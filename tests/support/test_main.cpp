@@ -1,0 +1,26 @@
+// main() of every test program: the tests write to the appliance's fixed paths, so they run
+// only inside the sandbox root made by tests/kyto-sandbox (ctest starts them that way).
+#include <stdio.h>
+#include <string.h>
+
+#include <gtest/gtest.h>
+
+#include "sandbox.h"
+
+int main(int argc, char** argv) {
+    bool listOnly = false;
+    for (int i = 1; i < argc; ++i) {
+        if (strcmp(argv[i], "--gtest_list_tests") == 0)
+            listOnly = true;
+    }
+    if (!listOnly && !kytotest::InSandbox()) {
+        fprintf(stderr,
+                "%s: refusing to run outside the test sandbox (this would write to the real "
+                "root).\nRun the tests with ctest, or by hand as root: "
+                "build/tests/kyto-sandbox %s [gtest options]\n",
+                argv[0], argv[0]);
+        return 2;
+    }
+    ::testing::InitGoogleTest(&argc, argv);
+    return RUN_ALL_TESTS();
+}
