@@ -1,0 +1,226 @@
+// CustomBugFix: merging patch-list entries (build 5644 in the sandbox's version file).
+#include <syslog.h>
+
+#include <memory>
+#include <sstream>
+
+#include "custombugfix.h"
+#include "deb_builder.h"
+#include "sandbox.h"
+
+namespace kytotest {
+namespace {
+
+const std::string kBase = "http://updates.example.invalid/smallupdate/5644/";
+
+Json::Value J(const std::string& text) {
+    Json::Value v;
+    Json::CharReaderBuilder builder;
+    std::string errors;
+    std::istringstream in(text);
+    EXPECT_TRUE(Json::parseFromStream(builder, in, &v, &errors)) << text << ": " << errors;
+    return v;
+}
+
+std::string Deb(const std::string& package, int fix) {
+    return DebFileName(MakeDebSpec(package, SmallFixVersion("6.1", 5644, fix)));
+}
+
+Json::Value Proj(const std::string& name, const std::string& file) {
+    Json::Value p;
+    p["name"] = name;
+    p["url"] = kBase + file;
+    return p;
+}
+
+// An entry of fix `version` shipping the given packages (name -> package file).
+Json::Value Entry(int version, const std::vector<Json::Value>& proj,
+                  const Json::Value& restart = "none", bool flash = false, bool config = false) {
+    Json::Value e;
+    e["version"] = version;
+    e["proj"] = Json::Value(Json::arrayValue);
+    for (const auto& p : proj)
+        e["proj"].append(p);
+    e["flash_upgrade"] = flash;
+    e["config_upgrade"] = config;
+    e["restart"] = restart;
+    return e;
+}
+
+Json::Value SmallOnly(int version, const Json::Value& restart = "none") {
+    return Entry(version, {Proj("smallupdate", Deb("smallupdate", version))}, restart);
+}
+
+using CustomBugFixTest = SandboxTest;
+
+TEST_F(CustomBugFixTest, NewerEntriesAreFoldedIntoOneResult) {
+    CustomBugFix fix(3);
+    // Fix 2 is older than the installed 3: its (mismatching) packages are never looked at.
+    EXPECT_EQ(fix.Merge(Entry(2, {Proj("smallupdate", Deb("smallupdate", 7))}, "reboot", true)), 1);
+    EXPECT_EQ(fix.Merge(Entry(
+                  5,
+                  {Proj("smallupdate", Deb("smallupdate", 5)),
+                   Proj("flashupdate", Deb("flashupdate", 5)), Proj("webui", Deb("webui", 5))},
+                  J(R"({"vyx_service": ["S20samba.sh"], "pkg": []})"), true)),
+              1);
+    EXPECT_EQ(fix.Merge(Entry(
+                  4,
+                  {Proj("smallupdate", Deb("smallupdate", 4)),
+                   Proj("flashupdate", Deb("flashupdate", 4)), Proj("webui", Deb("webui", 4))},
+                  J(R"({"vyx_service": ["S20samba.sh", "S99sshd.sh"],
+                                    "pkg": ["MediaServer", "MediaServer"]})"),
+                  false, true)),
+              1);
+
+    EXPECT_EQ(fix.m_smallFixNumber, 5);
+    EXPECT_EQ(fix.m_smallUpdateDeb, Deb("smallupdate", 5));
+    EXPECT_EQ(fix.m_smallUpdateDebLink, kBase + Deb("smallupdate", 5));
+    EXPECT_EQ(fix.m_flashUpdateDeb, Deb("flashupdate", 5));
+    EXPECT_EQ(fix.m_flashUpdateDebLink, kBase + Deb("flashupdate", 5));
+    EXPECT_EQ(fix.m_installDebs, (std::vector<std::string>{Deb("webui", 5), Deb("webui", 4)}));
+    EXPECT_EQ(fix.m_installDebLinks,
+              (std::vector<std::string>{kBase + Deb("webui", 5), kBase + Deb("webui", 4)}));
+    EXPECT_TRUE(fix.m_blFlashUpdate);
+    EXPECT_TRUE(fix.m_blConfigUpdate);
+    EXPECT_FALSE(fix.m_blNeedReboot);  // only the old entry asked for it
+    EXPECT_FALSE(fix.m_blRestartAllService);
+    EXPECT_EQ(fix.m_vyxServiceRestartList, (std::vector<std::string>{"S20samba.sh", "S99sshd.sh"}));
+    EXPECT_EQ(fix.m_pkgRestartList, std::vector<std::string>{"MediaServer"});
+    EXPECT_EQ(fix.m_curSmallFixNumber, 3);
+}
+
+TEST_F(CustomBugFixTest, OldEntriesOnlyRaiseTheNumber) {
+    CustomBugFix fix(5);
+    Json::Value old = Entry(5, {Proj("webui", Deb("webui", 5))}, "all_service", true, true);
+    EXPECT_EQ(fix.Merge(SmallOnly(3, "reboot")), 1);
+    EXPECT_EQ(fix.Merge(old), 1);
+    EXPECT_EQ(fix.m_smallFixNumber, 5);
+    EXPECT_FALSE(fix.m_blFlashUpdate || fix.m_blConfigUpdate || fix.m_blNeedReboot ||
+                 fix.m_blRestartAllService);
+    EXPECT_TRUE(fix.m_smallUpdateDeb.empty() && fix.m_installDebs.empty() &&
+                fix.m_vyxServiceRestartList.empty());
+
+    // Old entries still need all five keys.
+    for (const char* key : {"version", "proj", "flash_upgrade", "config_upgrade", "restart"}) {
+        Json::Value missing = SmallOnly(2);
+        missing.removeMember(key);
+        ClearSyslog();
+        EXPECT_EQ(fix.Merge(missing), 0) << key;
+        EXPECT_TRUE(SyslogContains("custombugfix:", LOG_ERR));
+        EXPECT_TRUE(SyslogContains("bad json format!", LOG_ERR)) << key;
+    }
+}
+
+TEST_F(CustomBugFixTest, RestartDemands) {
+    const std::string kWrongType = "wrong type of json format at 'restart' object";
+    struct Case {
+        std::string restart;  // JSON text
+        std::string message;  // "" when accepted
+        std::vector<std::string> services;
+    } cases[] = {
+        {R"("none")", "", {}},
+        {R"("reboot")", "", {}},
+        {R"("all_service")", "", {}},
+        {R"("sometimes")", "bad value in 'restart'", {}},
+        {R"({"vyx_service": [], "pkg": []})", "no data in pkg or vyx_service", {}},
+        {R"({"vyx_service": "a", "pkg": []})", "bad format in 'restart'", {}},
+        {R"({"vyx_service": ["a"]})", "bad format in 'restart'", {}},
+        {R"({"vyx_service": [["a"]], "pkg": []})", "bad format in 'restart'", {}},
+        {R"({"vyx_service": [7, "x", "x"], "pkg": []})", "", {"7", "x"}},
+        {R"(["reboot"])", kWrongType, {}},
+        {R"(null)", kWrongType, {}},
+    };
+    for (const auto& c : cases) {
+        ClearSyslog();
+        CustomBugFix fix(3);
+        EXPECT_EQ(fix.Merge(SmallOnly(4, J(c.restart))), c.message.empty() ? 1 : 0) << c.restart;
+        EXPECT_EQ(fix.m_blNeedReboot, c.restart == R"("reboot")") << c.restart;
+        EXPECT_EQ(fix.m_blRestartAllService, c.restart == R"("all_service")") << c.restart;
+        EXPECT_EQ(fix.m_vyxServiceRestartList, c.services) << c.restart;
+        if (c.message.empty()) {
+            EXPECT_EQ(fix.m_smallFixNumber, 4);
+            EXPECT_TRUE(SyslogMessages().empty()) << c.restart;
+        } else {
+            EXPECT_EQ(fix.m_smallFixNumber, -1) << c.restart;
+            EXPECT_TRUE(SyslogContains(c.message, LOG_ERR)) << c.restart;
+            EXPECT_TRUE(SyslogContains("failed to merge 'restart' status", LOG_ERR));
+        }
+    }
+}
+
+TEST_F(CustomBugFixTest, BadProjListsAreRefused) {
+    struct Case {
+        Json::Value proj;
+        std::string message;
+    } cases[] = {
+        {J("[]"), "empty array"},
+        {J("null"), "empty array"},
+        {J(R"({"name": "smallupdate"})"), "nothing can be parsed from 'proj' array"},
+        {J(R"(["smallupdate"])"), "nothing can be parsed from 'proj' array"},
+        {J(R"([{"name": 5, "url": "http://h/a"}])"), "nothing can be parsed from 'proj' array"},
+        {J(R"([{"name": "webui"}])"), "nothing can be parsed from 'proj' array"},
+        {J("[" + Json::FastWriter().write(Proj("smallupdate", Deb("smallupdate", 4))) + "]"),
+         "proj [smallupdate] debversion [4] not match smallfixverion[5]"},
+        {J(R"([{"name": "webui", "url": ")" + Deb("webui", 5) + R"("}])"),
+         "invalid debian url [" + Deb("webui", 5) + "]"},
+        {J(R"([{"name": "webui", "url": "http://h/webui.deb"}])"),
+         "failed to parse [webui.deb] to get smallfixnum [-1]"},
+        {J(R"([{"name": "webui", "url": "http://h/webui_6.1-5644-s0_all.deb"}])"),
+         "failed to parse [webui_6.1-5644-s0_all.deb] to get smallfixnum [0]"},
+    };
+    for (const auto& c : cases) {
+        ClearSyslog();
+        CustomBugFix fix(3);
+        Json::Value entry = SmallOnly(5);
+        entry["proj"] = c.proj;
+        EXPECT_EQ(fix.Merge(entry), 0) << c.message;
+        EXPECT_TRUE(SyslogContains(c.message, LOG_ERR)) << c.message;
+        EXPECT_TRUE(SyslogContains("failed to merge 'proj'", LOG_ERR)) << c.message;
+        EXPECT_EQ(fix.m_smallFixNumber, -1);
+    }
+
+    // A version below 1 is refused silently by the list merge itself.
+    ClearSyslog();
+    CustomBugFix fix(-1);
+    EXPECT_EQ(fix.MergeProjList(SmallOnly(0)["proj"], 0), 0);
+    EXPECT_TRUE(SyslogMessages().empty());
+}
+
+TEST_F(CustomBugFixTest, WrongJsonTypesNeverThrow) {
+    const char* entries[] = {
+        "[1, 2]",
+        R"("entry")",
+        "null",
+        R"({"version": "five", "proj": [], "flash_upgrade": false,
+            "config_upgrade": false, "restart": "none"})",
+        R"({"version": 1e12, "proj": [], "flash_upgrade": false,
+            "config_upgrade": false, "restart": "none"})",
+    };
+    for (const char* text : entries) {
+        CustomBugFix fix(3);
+        ClearSyslog();
+        EXPECT_NO_THROW(EXPECT_EQ(fix.Merge(J(text)), 0) << text);
+        EXPECT_TRUE(SyslogContains("bad json format!", LOG_ERR)) << text;
+        EXPECT_EQ(fix.m_smallFixNumber, -1);
+    }
+
+    // Flags that are not booleans do not read true, and do not stop the merge.
+    CustomBugFix fix(3);
+    Json::Value entry = SmallOnly(4);
+    entry["flash_upgrade"] = "yes";
+    entry["config_upgrade"] = J("[true]");
+    EXPECT_EQ(fix.Merge(entry), 1);
+    EXPECT_FALSE(fix.m_blFlashUpdate || fix.m_blConfigUpdate);
+}
+
+TEST(CustomBugFixFind, ComparesWholeStrings) {
+    std::vector<std::string> list = {"S20samba.sh", "S99sshd.sh", ""};
+    EXPECT_EQ(CustomBugFix::Find(list, "S99sshd.sh"), 1);
+    EXPECT_EQ(CustomBugFix::Find(list, ""), 1);
+    EXPECT_EQ(CustomBugFix::Find(list, "S20samba"), 0);
+    EXPECT_EQ(CustomBugFix::Find(list, std::string("S20samba.sh\0x", 13)), 0);
+    EXPECT_EQ(CustomBugFix::Find({}, "S20samba.sh"), 0);
+}
+
+}  // namespace
+}  // namespace kytotest
