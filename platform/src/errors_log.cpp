@@ -54,23 +54,31 @@ ErrorKeeper::ErrorKeeper()
     : code_(t_lastError.code), line_(t_lastError.line), file_(t_lastError.file) {}
 
 ErrorKeeper::~ErrorKeeper() {
-    if (active_) KLIBCErrSetEx(code_, file_.c_str(), line_);
+    if (active_)
+        KLIBCErrSetEx(code_, file_.c_str(), line_);
 }
 
 }  // namespace kytoplat
 
 extern "C" {
 
-int KLIBCErrGet(void) { return t_lastError.code; }
+int KLIBCErrGet(void) {
+    return t_lastError.code;
+}
 
-const char* KLIBCErrorGetFile(void) { return t_lastError.file; }
+const char* KLIBCErrorGetFile(void) {
+    return t_lastError.file;
+}
 
-int KLIBCErrorGetLine(void) { return t_lastError.line; }
+int KLIBCErrorGetLine(void) {
+    return t_lastError.line;
+}
 
 void KLIBCErrSetEx(int code, const char* file, int line) {
     t_lastError.code = code;
     t_lastError.line = line;
-    if (file == nullptr) file = "";
+    if (file == nullptr)
+        file = "";
     size_t len = strnlen(file, kErrFileMax);
     memcpy(t_lastError.file, file, len);
     t_lastError.file[len] = '\0';
@@ -87,15 +95,15 @@ int KLIBCErrLogSet(const char* logPath, const char* text) {
 int KYTOLogSet1(int category, int level, unsigned int eventCode, const char* s1, const char* s2,
                 const char* s3, const char* s4) {
     auto str = [](const char* s) { return s ? s : ""; };
-    int len = snprintf(nullptr, 0, "%d %d 0x%08X %s %s %s %s", category, level, eventCode,
-                       str(s1), str(s2), str(s3), str(s4));
+    int len = snprintf(nullptr, 0, "%d %d 0x%08X %s %s %s %s", category, level, eventCode, str(s1),
+                       str(s2), str(s3), str(s4));
     if (len < 0) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
     std::string text(static_cast<size_t>(len) + 1, '\0');
-    snprintf(&text[0], text.size(), "%d %d 0x%08X %s %s %s %s", category, level, eventCode,
-             str(s1), str(s2), str(s3), str(s4));
+    snprintf(&text[0], text.size(), "%d %d 0x%08X %s %s %s %s", category, level, eventCode, str(s1),
+             str(s2), str(s3), str(s4));
     text.resize(static_cast<size_t>(len));
     // The syslog copy is sent even when the event log file cannot be written, so the
     // event is not lost entirely.

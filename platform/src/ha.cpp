@@ -15,8 +15,10 @@ namespace {
 int LoadStatus(std::vector<std::string>* lines) {
     bool endsWithNewline;
     kytoplat::ErrorKeeper keeper;
-    if (kytoplat::KvLoad(KYTO_HA_STATUS_PATH, lines, &endsWithNewline) == 0) return 1;
-    if (KLIBCErrGet() == KYTO_ERR_FILE_NOT_FOUND) return 0;
+    if (kytoplat::KvLoad(KYTO_HA_STATUS_PATH, lines, &endsWithNewline) == 0)
+        return 1;
+    if (KLIBCErrGet() == KYTO_ERR_FILE_NOT_FOUND)
+        return 0;
     keeper.dismiss();
     return -1;
 }
@@ -27,7 +29,8 @@ extern "C" {
 
 int KYTOHAIsRunning(void) {
     std::vector<std::string> lines;
-    if (LoadStatus(&lines) != 1) return 0;
+    if (LoadStatus(&lines) != 1)
+        return 0;
     std::string running;
     return kytoplat::KvFind(lines, "running", &running) == 1 && running == "yes" ? 1 : 0;
 }
@@ -40,9 +43,11 @@ int KYTOHAIsHybridDL(char* partnerUnique, int size) {
     partnerUnique[0] = '\0';
     std::vector<std::string> lines;
     int rc = LoadStatus(&lines);
-    if (rc <= 0) return rc;
+    if (rc <= 0)
+        return rc;
     std::string hybrid, partner;
-    if (kytoplat::KvFind(lines, "hybrid_dl", &hybrid) != 1 || hybrid != "yes") return 0;
+    if (kytoplat::KvFind(lines, "hybrid_dl", &hybrid) != 1 || hybrid != "yes")
+        return 0;
     if (kytoplat::KvFind(lines, "partner_unique", &partner) != 1 || partner.empty()) {
         KYTO_FAIL(KYTO_ERR_NOT_FOUND);
         return -1;

@@ -19,16 +19,21 @@ namespace {
 
 constexpr const char* kDefaultLineFormat = "%s=\"%s\"\n";
 
-bool IsBlank(char c) { return c == ' ' || c == '\t' || c == '\r'; }
+bool IsBlank(char c) {
+    return c == ' ' || c == '\t' || c == '\r';
+}
 
 // True when fmt has exactly two "%s" conversions and no other conversion ("%%" allowed).
 bool ValidLineFormat(const char* fmt) {
     int strings = 0;
     for (const char* p = fmt; *p; ++p) {
-        if (*p != '%') continue;
+        if (*p != '%')
+            continue;
         ++p;
-        if (*p == '%') continue;
-        if (*p != 's') return false;
+        if (*p == '%')
+            continue;
+        if (*p != 's')
+            return false;
         ++strings;
     }
     return strings == 2;
@@ -39,7 +44,8 @@ bool WriteAll(int fd, const std::string& data) {
     while (done < data.size()) {
         ssize_t n = ::write(fd, data.data() + done, data.size() - done);
         if (n < 0) {
-            if (errno == EINTR) continue;
+            if (errno == EINTR)
+                continue;
             return false;
         }
         done += static_cast<size_t>(n);
@@ -69,7 +75,7 @@ int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewl
     UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
     if (!fd.valid()) {
         KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                       : KYTO_ERR_FILE_OPEN);
+                                                      : KYTO_ERR_FILE_OPEN);
         return -1;
     }
     struct stat st;
@@ -84,11 +90,13 @@ int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewl
     for (;;) {
         ssize_t n = ::read(fd.get(), chunk.data(), chunk.size());
         if (n < 0) {
-            if (errno == EINTR) continue;
+            if (errno == EINTR)
+                continue;
             KYTO_FAIL(KYTO_ERR_FILE_READ);
             return -1;
         }
-        if (n == 0) break;
+        if (n == 0)
+            break;
         const char* p = chunk.data();
         const char* end = p + n;
         while (p < end) {
@@ -99,7 +107,8 @@ int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewl
                 KYTO_FAIL(KYTO_ERR_LINE_TOO_LONG);
                 return -1;
             }
-            if (!nl) break;
+            if (!nl)
+                break;
             lines->push_back(std::move(cur));
             cur.clear();
             p = nl + 1;
@@ -114,28 +123,37 @@ int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewl
 
 bool KvLineMatches(const std::string& line, const std::string& key, std::string* value) {
     size_t b = 0;
-    while (b < line.size() && IsBlank(line[b])) ++b;
-    if (b == line.size() || line[b] == '#') return false;
+    while (b < line.size() && IsBlank(line[b]))
+        ++b;
+    if (b == line.size() || line[b] == '#')
+        return false;
     size_t eq = line.find('=', b);
-    if (eq == std::string::npos) return false;
+    if (eq == std::string::npos)
+        return false;
     size_t e = eq;
-    while (e > b && IsBlank(line[e - 1])) --e;
-    if (line.compare(b, e - b, key) != 0 || e - b != key.size()) return false;
+    while (e > b && IsBlank(line[e - 1]))
+        --e;
+    if (line.compare(b, e - b, key) != 0 || e - b != key.size())
+        return false;
     size_t vb = eq + 1;
     size_t ve = line.size();
-    while (vb < ve && IsBlank(line[vb])) ++vb;
-    while (ve > vb && IsBlank(line[ve - 1])) --ve;
+    while (vb < ve && IsBlank(line[vb]))
+        ++vb;
+    while (ve > vb && IsBlank(line[ve - 1]))
+        --ve;
     if (ve - vb >= 2 && line[vb] == '"' && line[ve - 1] == '"') {
         ++vb;
         --ve;
     }
-    if (value) value->assign(line, vb, ve - vb);
+    if (value)
+        value->assign(line, vb, ve - vb);
     return true;
 }
 
 int KvFind(const std::vector<std::string>& lines, const std::string& key, std::string* value) {
     for (const std::string& line : lines) {
-        if (KvLineMatches(line, key, value)) return 1;
+        if (KvLineMatches(line, key, value))
+            return 1;
     }
     return 0;
 }
@@ -143,7 +161,8 @@ int KvFind(const std::vector<std::string>& lines, const std::string& key, std::s
 int KvGet(const char* path, const std::string& key, std::string* value) {
     std::vector<std::string> lines;
     bool endsWithNewline;
-    if (KvLoad(path, &lines, &endsWithNewline) != 0) return -1;
+    if (KvLoad(path, &lines, &endsWithNewline) != 0)
+        return -1;
     return KvFind(lines, key, value);
 }
 
@@ -159,13 +178,14 @@ int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size,
     }
     std::string value;
     int rc = kytoplat::KvGet(path, key, &value);
-    if (rc < 0) return -1;
+    if (rc < 0)
+        return -1;
     if (rc == 0) {
         buf[0] = '\0';
         return 0;
     }
-    size_t n = value.size() < static_cast<size_t>(size - 1) ? value.size()
-                                                            : static_cast<size_t>(size - 1);
+    size_t n =
+        value.size() < static_cast<size_t>(size - 1) ? value.size() : static_cast<size_t>(size - 1);
     memcpy(buf, value.data(), n);
     buf[n] = '\0';
     return static_cast<int>(n);
@@ -173,7 +193,8 @@ int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size,
 
 int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
                          const char* lineFormat) {
-    if (lineFormat == nullptr) lineFormat = kDefaultLineFormat;
+    if (lineFormat == nullptr)
+        lineFormat = kDefaultLineFormat;
     if (path == nullptr || *path == '\0' || key == nullptr || *key == '\0' || value == nullptr ||
         key[0] == '#' || IsBlank(key[0]) || IsBlank(key[strlen(key) - 1]) ||
         strpbrk(key, "=\n") != nullptr || strchr(value, '\n') != nullptr ||
@@ -195,7 +216,8 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
             lines.clear();  // no file yet: it is created
         } else {
             struct stat st;
-            if (::stat(path, &st) == 0) mode = st.st_mode & 07777;
+            if (::stat(path, &st) == 0)
+                mode = st.st_mode & 07777;
         }
     }
 
@@ -209,7 +231,8 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
     newLine.resize(static_cast<size_t>(len));
     // Every line ends with a newline, even when the format forgot it, so that the next
     // line is not glued to this one.
-    if (newLine.empty() || newLine.back() != '\n') newLine.push_back('\n');
+    if (newLine.empty() || newLine.back() != '\n')
+        newLine.push_back('\n');
 
     std::string content;
     bool replaced = false;
@@ -220,10 +243,12 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
             continue;
         }
         content += lines[i];
-        if (i + 1 < lines.size() || endsWithNewline) content.push_back('\n');
+        if (i + 1 < lines.size() || endsWithNewline)
+            content.push_back('\n');
     }
     if (!replaced) {
-        if (!content.empty() && content.back() != '\n') content.push_back('\n');
+        if (!content.empty() && content.back() != '\n')
+            content.push_back('\n');
         content += newLine;
     }
 
@@ -233,12 +258,11 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
     kytoplat::UniqueFd fd(::mkostemp(&tmpl[0], O_CLOEXEC));
     if (!fd.valid()) {
         KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                       : KYTO_ERR_FILE_WRITE);
+                                                      : KYTO_ERR_FILE_WRITE);
         return -1;
     }
     kytoplat::ScopedUnlink cleanup(tmpl);
-    if (::fchmod(fd.get(), mode) != 0 || !WriteAll(fd.get(), content) ||
-        ::fsync(fd.get()) != 0) {
+    if (::fchmod(fd.get(), mode) != 0 || !WriteAll(fd.get(), content) || ::fsync(fd.get()) != 0) {
         KYTO_FAIL(KYTO_ERR_FILE_WRITE);
         return -1;
     }

@@ -17,11 +17,12 @@
 #define KYTO_FAIL(code) KLIBCErrSetEx((code), __FILE__, __LINE__)
 
 // Internal: hidden from the library's exported symbols.
-namespace __attribute__((visibility("hidden"))) kytoplat {
+#pragma GCC visibility push(hidden)
+namespace kytoplat {
 
 // Owns a file descriptor.
 class UniqueFd {
-public:
+  public:
     UniqueFd() = default;
     explicit UniqueFd(int fd) : fd_(fd) {}
     ~UniqueFd() { reset(); }
@@ -32,20 +33,22 @@ public:
     bool valid() const { return fd_ >= 0; }
     int release() { return std::exchange(fd_, -1); }
     void reset(int fd = -1) {
-        if (fd_ >= 0) ::close(fd_);
+        if (fd_ >= 0)
+            ::close(fd_);
         fd_ = fd;
     }
 
-private:
+  private:
     int fd_ = -1;
 };
 
 // Owns a FILE* from fopen/fdopen.
 class UniqueFile {
-public:
+  public:
     explicit UniqueFile(FILE* f = nullptr) : f_(f) {}
     ~UniqueFile() {
-        if (f_) ::fclose(f_);
+        if (f_)
+            ::fclose(f_);
     }
     UniqueFile(const UniqueFile&) = delete;
     UniqueFile& operator=(const UniqueFile&) = delete;
@@ -53,22 +56,23 @@ public:
     FILE* get() const { return f_; }
     explicit operator bool() const { return f_ != nullptr; }
 
-private:
+  private:
     FILE* f_ = nullptr;
 };
 
 // Unlinks a path when it goes out of scope, unless released.
 class ScopedUnlink {
-public:
+  public:
     explicit ScopedUnlink(std::string path) : path_(std::move(path)) {}
     ~ScopedUnlink() {
-        if (!path_.empty()) ::unlink(path_.c_str());
+        if (!path_.empty())
+            ::unlink(path_.c_str());
     }
     ScopedUnlink(const ScopedUnlink&) = delete;
     ScopedUnlink& operator=(const ScopedUnlink&) = delete;
     void release() { path_.clear(); }
 
-private:
+  private:
     std::string path_;
 };
 
@@ -76,14 +80,14 @@ private:
 // dismissed.  Used by calls that try something whose failure is not their own failure
 // (an absent optional file, for instance), so that they leave the caller's error alone.
 class ErrorKeeper {
-public:
+  public:
     ErrorKeeper();
     ~ErrorKeeper();
     ErrorKeeper(const ErrorKeeper&) = delete;
     ErrorKeeper& operator=(const ErrorKeeper&) = delete;
     void dismiss() { active_ = false; }
 
-private:
+  private:
     bool active_ = true;
     int code_;
     int line_;
@@ -121,5 +125,6 @@ int SpawnProgram(const char* prog, char* const argv[], pid_t* pid, bool* execFai
 int WaitProgram(pid_t pid);
 
 }  // namespace kytoplat
+#pragma GCC visibility pop
 
 #endif

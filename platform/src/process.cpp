@@ -28,13 +28,16 @@ int ParsePid(const std::string& text) {
     long long pid = 0;
     while (i < text.size() && text[i] >= '0' && text[i] <= '9') {
         pid = pid * 10 + (text[i] - '0');
-        if (pid > INT_MAX) return 0;
+        if (pid > INT_MAX)
+            return 0;
         ++i;
     }
-    if (i == 0) return 0;
+    if (i == 0)
+        return 0;
     for (; i < text.size(); ++i) {
         char c = text[i];
-        if (c != ' ' && c != '\t' && c != '\n' && c != '\r') return 0;
+        if (c != ' ' && c != '\t' && c != '\n' && c != '\r')
+            return 0;
     }
     return static_cast<int>(pid);
 }
@@ -76,7 +79,8 @@ int SpawnProgram(const char* prog, char* const argv[], pid_t* pid, bool* execFai
             (void)ignored;
             ::_exit(127);
         }
-        if (nul != STDIN_FILENO) ::close(nul);
+        if (nul != STDIN_FILENO)
+            ::close(nul);
         ::execv(prog, argv);
         int err = errno;
         ssize_t ignored = ::write(p[1], &err, sizeof err);
@@ -111,8 +115,7 @@ int WaitProgram(pid_t pid) {
 
 extern "C" {
 
-int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3,
-              const char* a4) {
+int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4) {
     if (prog == nullptr || *prog == '\0') {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -120,10 +123,12 @@ int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3,
     // argv is complete before the fork: the child must not allocate.
     char* argv[6] = {const_cast<char*>(prog), nullptr, nullptr, nullptr, nullptr, nullptr};
     const char* args[4] = {a1, a2, a3, a4};
-    for (int i = 0; i < 4 && args[i] != nullptr; ++i) argv[i + 1] = const_cast<char*>(args[i]);
+    for (int i = 0; i < 4 && args[i] != nullptr; ++i)
+        argv[i + 1] = const_cast<char*>(args[i]);
     pid_t pid;
     bool execFailed;
-    if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0) return -1;
+    if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0)
+        return -1;
     return kytoplat::WaitProgram(pid);
 }
 
@@ -134,8 +139,10 @@ int KLIBCExecv(const char* prog, char* const argv[], int blWait) {
     }
     pid_t pid;
     bool execFailed;
-    if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0) return -1;
-    if (!blWait) return pid;
+    if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0)
+        return -1;
+    if (!blWait)
+        return pid;
     return kytoplat::WaitProgram(pid);
 }
 
@@ -147,7 +154,7 @@ int KLIBCReadPidFile(const char* path) {
     kytoplat::UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
     if (!fd.valid()) {
         KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                       : KYTO_ERR_FILE_OPEN);
+                                                      : KYTO_ERR_FILE_OPEN);
         return -1;
     }
     struct stat st;
@@ -160,21 +167,25 @@ int KLIBCReadPidFile(const char* path) {
     while (text.size() <= kPidFileMax) {
         ssize_t n = ::read(fd.get(), buf, sizeof buf);
         if (n < 0) {
-            if (errno == EINTR) continue;
+            if (errno == EINTR)
+                continue;
             KYTO_FAIL(KYTO_ERR_FILE_READ);
             return -1;
         }
-        if (n == 0) break;
+        if (n == 0)
+            break;
         text.append(buf, static_cast<size_t>(n));
     }
     int pid = text.size() > kPidFileMax ? 0 : ParsePid(text);
-    if (pid == 0) KYTO_FAIL(KYTO_ERR_NOT_FOUND);
+    if (pid == 0)
+        KYTO_FAIL(KYTO_ERR_NOT_FOUND);
     return pid;
 }
 
 int KLIBCIsProcAlive(const char* pidFile) {
     int pid = PidFromFile(pidFile);
-    if (pid < 0) return 0;
+    if (pid < 0)
+        return 0;
     if (::kill(pid, 0) != 0) {
         KYTO_FAIL(KYTO_ERR_PROCESS);
         return 0;
@@ -184,7 +195,8 @@ int KLIBCIsProcAlive(const char* pidFile) {
 
 int KLIBCKill(const char* pidFile, int blForce) {
     int pid = PidFromFile(pidFile);
-    if (pid < 0) return -1;
+    if (pid < 0)
+        return -1;
     if (::kill(pid, blForce ? SIGKILL : SIGTERM) != 0) {
         KYTO_FAIL(KYTO_ERR_PROCESS);
         return -1;

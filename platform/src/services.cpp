@@ -31,7 +31,8 @@ int RunOne(const char* prog, const char* arg) {
     char* argv[3] = {const_cast<char*>(prog), const_cast<char*>(arg), nullptr};
     pid_t pid;
     bool execFailed;
-    if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0) return -1;
+    if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0)
+        return -1;
     int status = kytoplat::WaitProgram(pid);
     if (execFailed) {
         KYTO_FAIL(KYTO_ERR_EXEC);
@@ -52,13 +53,14 @@ int KYTOServiceOnOffALL(int action) {
     std::unique_ptr<DIR, DirCloser> dir(opendir(kRcDir));
     if (!dir) {
         KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                       : KYTO_ERR_FILE_OPEN);
+                                                      : KYTO_ERR_FILE_OPEN);
         return -1;
     }
     std::vector<std::string> scripts;
     errno = 0;
     while (struct dirent* e = readdir(dir.get())) {
-        if (fnmatch("S*.sh", e->d_name, FNM_PERIOD) == 0) scripts.emplace_back(e->d_name);
+        if (fnmatch("S*.sh", e->d_name, FNM_PERIOD) == 0)
+            scripts.emplace_back(e->d_name);
     }
     if (errno != 0) {
         KYTO_FAIL(KYTO_ERR_FILE_READ);
@@ -67,7 +69,8 @@ int KYTOServiceOnOffALL(int action) {
     dir.reset();
     // Byte order of the names, independent of the locale.
     std::sort(scripts.begin(), scripts.end());
-    if (action == KYTO_SERVICE_STOP_ALL) std::reverse(scripts.begin(), scripts.end());
+    if (action == KYTO_SERVICE_STOP_ALL)
+        std::reverse(scripts.begin(), scripts.end());
     const char* arg = action == KYTO_SERVICE_STOP_ALL ? "stop" : "start";
     // Like an init system, one failing script does not stop the others; its status is
     // not part of the result.
@@ -75,7 +78,8 @@ int KYTOServiceOnOffALL(int action) {
     for (const std::string& name : scripts) {
         std::string path = std::string(kRcDir) + "/" + name;
         struct stat st;
-        if (stat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) continue;
+        if (stat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode))
+            continue;
         RunOne(path.c_str(), arg);
     }
     return 0;

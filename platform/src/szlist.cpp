@@ -18,7 +18,8 @@ namespace {
 size_t ListBytes(int capacity) {
     size_t header = offsetof(KLIBC_SZLIST, pszItem);
     size_t n = static_cast<size_t>(capacity);
-    if (n > (SIZE_MAX - header) / sizeof(char*)) return 0;
+    if (n > (SIZE_MAX - header) / sizeof(char*))
+        return 0;
     return header + n * sizeof(char*);
 }
 
@@ -53,7 +54,8 @@ int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) {
     for (;;) {
         size_t n = *delims ? strcspn(p, delims) : strlen(p);
         pieces.emplace_back(p, n);
-        if (p[n] == '\0') break;
+        if (p[n] == '\0')
+            break;
         p += n + 1;
     }
     PKLIBC_SZLIST l = *list;
@@ -64,14 +66,16 @@ int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) {
     int need = l->nItem + static_cast<int>(pieces.size());
     if (need > l->nAlloc) {
         int cap = l->nAlloc;
-        while (cap < need) cap = cap > INT_MAX / 2 ? need : cap * 2;
+        while (cap < need)
+            cap = cap > INT_MAX / 2 ? need : cap * 2;
         size_t bytes = ListBytes(cap);
         PKLIBC_SZLIST grown = bytes ? static_cast<PKLIBC_SZLIST>(realloc(l, bytes)) : nullptr;
         if (grown == nullptr) {
             KYTO_FAIL(KYTO_ERR_OUT_OF_MEMORY);
             return -1;
         }
-        for (int i = grown->nAlloc; i < cap; ++i) grown->pszItem[i] = nullptr;
+        for (int i = grown->nAlloc; i < cap; ++i)
+            grown->pszItem[i] = nullptr;
         grown->nAlloc = cap;
         *list = l = grown;
     }
@@ -81,27 +85,30 @@ int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) {
     for (const std::string& piece : pieces) {
         char* copy = strdup(piece.c_str());
         if (copy == nullptr) {
-            for (char* c : copies) free(c);
+            for (char* c : copies)
+                free(c);
             KYTO_FAIL(KYTO_ERR_OUT_OF_MEMORY);
             return -1;
         }
         copies.push_back(copy);
     }
-    for (char* c : copies) l->pszItem[l->nItem++] = c;
+    for (char* c : copies)
+        l->pszItem[l->nItem++] = c;
     return static_cast<int>(copies.size());
 }
 
 int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSize) {
-    if (list == nullptr || sep == nullptr || buf == nullptr || bufSize == nullptr ||
-        *bufSize < 0 || (*buf == nullptr && *bufSize != 0) || list->nItem < 0 ||
-        list->nItem > list->nAlloc) {
+    if (list == nullptr || sep == nullptr || buf == nullptr || bufSize == nullptr || *bufSize < 0 ||
+        (*buf == nullptr && *bufSize != 0) || list->nItem < 0 || list->nItem > list->nAlloc) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
     std::string joined;
     for (int i = 0; i < list->nItem; ++i) {
-        if (i > 0) joined += sep;
-        if (list->pszItem[i]) joined += list->pszItem[i];
+        if (i > 0)
+            joined += sep;
+        if (list->pszItem[i])
+            joined += list->pszItem[i];
     }
     if (joined.size() >= static_cast<size_t>(INT_MAX)) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
@@ -122,8 +129,10 @@ int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSiz
 }
 
 void KLIBCSzListFree(PKLIBC_SZLIST list) {
-    if (list == nullptr) return;
-    for (int i = 0; i < list->nItem && i < list->nAlloc; ++i) free(list->pszItem[i]);
+    if (list == nullptr)
+        return;
+    for (int i = 0; i < list->nItem && i < list->nAlloc; ++i)
+        free(list->pszItem[i]);
     free(list);
 }
 

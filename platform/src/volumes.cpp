@@ -28,9 +28,9 @@ struct MountEntry {
 std::string Unescape(const std::string& field) {
     std::string out;
     for (size_t i = 0; i < field.size(); ++i) {
-        if (field[i] == '\\' && i + 3 < field.size() &&
-            field[i + 1] >= '0' && field[i + 1] <= '3' && field[i + 2] >= '0' &&
-            field[i + 2] <= '7' && field[i + 3] >= '0' && field[i + 3] <= '7') {
+        if (field[i] == '\\' && i + 3 < field.size() && field[i + 1] >= '0' &&
+            field[i + 1] <= '3' && field[i + 2] >= '0' && field[i + 2] <= '7' &&
+            field[i + 3] >= '0' && field[i + 3] <= '7') {
             out.push_back(static_cast<char>((field[i + 1] - '0') * 64 + (field[i + 2] - '0') * 8 +
                                             (field[i + 3] - '0')));
             i += 3;
@@ -44,9 +44,11 @@ std::string Unescape(const std::string& field) {
 // "/volume" followed by one or more digits and nothing else.
 bool IsDataVolume(const std::string& dir) {
     static const std::string prefix = "/volume";
-    if (dir.size() <= prefix.size() || dir.compare(0, prefix.size(), prefix) != 0) return false;
+    if (dir.size() <= prefix.size() || dir.compare(0, prefix.size(), prefix) != 0)
+        return false;
     for (size_t i = prefix.size(); i < dir.size(); ++i) {
-        if (dir[i] < '0' || dir[i] > '9') return false;
+        if (dir[i] < '0' || dir[i] > '9')
+            return false;
     }
     return true;
 }
@@ -55,10 +57,12 @@ bool HasRoOption(const std::string& options) {
     size_t start = 0;
     for (;;) {
         size_t comma = options.find(',', start);
-        std::string opt = options.substr(start, comma == std::string::npos ? std::string::npos
-                                                                            : comma - start);
-        if (opt == "ro") return true;
-        if (comma == std::string::npos) return false;
+        std::string opt =
+            options.substr(start, comma == std::string::npos ? std::string::npos : comma - start);
+        if (opt == "ro")
+            return true;
+        if (comma == std::string::npos)
+            return false;
         start = comma + 1;
     }
 }
@@ -67,10 +71,13 @@ std::vector<std::string> Fields(const std::string& line) {
     std::vector<std::string> out;
     size_t i = 0;
     while (i < line.size()) {
-        while (i < line.size() && (line[i] == ' ' || line[i] == '\t')) ++i;
+        while (i < line.size() && (line[i] == ' ' || line[i] == '\t'))
+            ++i;
         size_t b = i;
-        while (i < line.size() && line[i] != ' ' && line[i] != '\t') ++i;
-        if (i > b) out.push_back(line.substr(b, i - b));
+        while (i < line.size() && line[i] != ' ' && line[i] != '\t')
+            ++i;
+        if (i > b)
+            out.push_back(line.substr(b, i - b));
     }
     return out;
 }
@@ -88,11 +95,14 @@ int ReadDataMounts(std::vector<MountEntry>* mounts) {
     ssize_t n;
     while ((n = getline(&line, &cap, f.get())) > 0) {
         std::string text(line, static_cast<size_t>(n));
-        if (!text.empty() && text.back() == '\n') text.pop_back();
+        if (!text.empty() && text.back() == '\n')
+            text.pop_back();
         std::vector<std::string> fields = Fields(text);
-        if (fields.size() < 4) continue;
+        if (fields.size() < 4)
+            continue;
         std::string dir = Unescape(fields[1]);
-        if (!IsDataVolume(dir)) continue;
+        if (!IsDataVolume(dir))
+            continue;
         bool ro = HasRoOption(fields[3]);
         bool seen = false;
         for (MountEntry& m : *mounts) {
@@ -101,7 +111,8 @@ int ReadDataMounts(std::vector<MountEntry>* mounts) {
                 seen = true;
             }
         }
-        if (!seen) mounts->push_back(MountEntry{dir, ro});
+        if (!seen)
+            mounts->push_back(MountEntry{dir, ro});
     }
     bool readError = ferror(f.get()) != 0;
     free(line);
@@ -122,7 +133,8 @@ PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) {
         return nullptr;
     }
     std::vector<MountEntry> mounts;
-    if (ReadDataMounts(&mounts) != 0) return nullptr;
+    if (ReadDataMounts(&mounts) != 0)
+        return nullptr;
     if (mounts.empty()) {
         KYTO_FAIL(KYTO_ERR_NOT_FOUND);
         return nullptr;
@@ -130,7 +142,8 @@ PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) {
     PKYTO_MOUNT_VOL_INFO head = nullptr;
     PKYTO_MOUNT_VOL_INFO* tail = &head;
     for (const MountEntry& m : mounts) {
-        if (m.dir.size() >= KYTO_VOL_PATH_MAX) continue;  // cannot be represented
+        if (m.dir.size() >= KYTO_VOL_PATH_MAX)
+            continue;  // cannot be represented
         struct statvfs vfs;
         if (statvfs(m.dir.c_str(), &vfs) != 0) {
             KYTOMountVolInfoFree(head);
@@ -151,7 +164,8 @@ PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) {
         *tail = node;
         tail = &node->pNext;
     }
-    if (head == nullptr) KYTO_FAIL(KYTO_ERR_NOT_FOUND);
+    if (head == nullptr)
+        KYTO_FAIL(KYTO_ERR_NOT_FOUND);
     return head;
 }
 
@@ -173,7 +187,8 @@ int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out,
         kytoplat::ErrorKeeper keeper;
         list = KYTOMountVolInfoEnum(0);
         if (list == nullptr) {
-            if (KLIBCErrGet() == KYTO_ERR_NOT_FOUND) return 0;  // no volume: not an error
+            if (KLIBCErrGet() == KYTO_ERR_NOT_FOUND)
+                return 0;  // no volume: not an error
             keeper.dismiss();
             return -1;
         }
@@ -199,11 +214,14 @@ int KYTOFSMkdirP(const char* path, mode_t mode) {
         return -1;
     }
     std::string p(path);
-    while (p.size() > 1 && p.back() == '/') p.pop_back();
+    while (p.size() > 1 && p.back() == '/')
+        p.pop_back();
     // Create each prefix ending before a '/', then the whole path.
     for (size_t i = 1; i <= p.size(); ++i) {
-        if (i < p.size() && p[i] != '/') continue;
-        if (p[i - 1] == '/') continue;  // "//" inside the path
+        if (i < p.size() && p[i] != '/')
+            continue;
+        if (p[i - 1] == '/')
+            continue;  // "//" inside the path
         std::string prefix = p.substr(0, i);
         if (mkdir(prefix.c_str(), mode) != 0 && errno != EEXIST) {
             KYTO_FAIL(errno == ENOENT ? KYTO_ERR_FILE_NOT_FOUND : KYTO_ERR_SYSTEM);

@@ -42,10 +42,18 @@ TEST_F(KeyValueTest, ReadsBothLineFormsAndSkipsComments) {
         int rc;
         const char* value;
     } cases[] = {
-        {"plain", 1, "1"},       {"quoted", 9, "two words"}, {"spaced", 1, "x"},
-        {"empty", 0, ""},        {"emptyquoted", 0, ""},     {"dup", 5, "first"},
-        {"note", 0, ""},         {"# note", 0, ""},          {"ab", 0, ""},
-        {"noequals", 0, ""},     {"inner", 5, "a\"b\"c"},    {"eq", 3, "a=b"},
+        {"plain", 1, "1"},
+        {"quoted", 9, "two words"},
+        {"spaced", 1, "x"},
+        {"empty", 0, ""},
+        {"emptyquoted", 0, ""},
+        {"dup", 5, "first"},
+        {"note", 0, ""},
+        {"# note", 0, ""},
+        {"ab", 0, ""},
+        {"noequals", 0, ""},
+        {"inner", 5, "a\"b\"c"},
+        {"eq", 3, "a=b"},
         {"last", 10, "no newline"},
     };
     for (const Case& c : cases) {
@@ -95,8 +103,7 @@ TEST_F(KeyValueTest, BadArgumentsAndUnreadableFilesLeaveBufferAlone) {
         {"/tmp/kv/folder", "k", buf, 16, 0, KYTO_ERR_FILE_OPEN},
     };
     for (const Case& c : cases) {
-        SCOPED_TRACE(std::string(c.path ? c.path : "(null)") + " size " +
-                     std::to_string(c.size));
+        SCOPED_TRACE(std::string(c.path ? c.path : "(null)") + " size " + std::to_string(c.size));
         strcpy(buf, "untouched");
         KLIBCErrSetEx(0, "", 0);
         EXPECT_EQ(KLIBCFileGetKeyValue(c.path, c.key, c.buf, c.size, c.flags), -1);
@@ -181,8 +188,8 @@ TEST_F(KeyValueTest, SetCreatesFilesAndKeepsModes) {
     ASSERT_EQ(mkdir("/tmp/kv/folder", 0755), 0);
     EXPECT_EQ(KLIBCFileSetKeyValue("/tmp/kv/folder", "k", "v", nullptr), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_FILE_OPEN);
-    EXPECT_EQ(ListDir("/tmp/kv"), (std::vector<std::string>{"folder", "other", "secret",
-                                                             "test.conf"}));
+    EXPECT_EQ(ListDir("/tmp/kv"),
+              (std::vector<std::string>{"folder", "other", "secret", "test.conf"}));
 }
 
 TEST_F(KeyValueTest, SetRejectsBadArgumentsAndFormats) {
@@ -194,14 +201,14 @@ TEST_F(KeyValueTest, SetRejectsBadArgumentsAndFormats) {
         const char* value;
         const char* format;
     } cases[] = {
-        {nullptr, "k", "v", nullptr},     {"", "k", "v", nullptr},
-        {kFile, nullptr, "v", nullptr},   {kFile, "", "v", nullptr},
-        {kFile, "k", nullptr, nullptr},   {kFile, "a=b", "v", nullptr},
-        {kFile, "a\nb", "v", nullptr},    {kFile, "#k", "v", nullptr},
-        {kFile, " k", "v", nullptr},      {kFile, "k", "two\nlines", nullptr},
-        {kFile, "k", "v", "%s"},          {kFile, "k", "v", "%s=%s=%s\n"},
-        {kFile, "k", "v", "%d=%s\n"},     {kFile, "k", "v", "%s=%s%n"},
-        {kFile, "k", "v", "%5s=%s\n"},    {kFile, "k", "v", "%s=%s%"},
+        {nullptr, "k", "v", nullptr},    {"", "k", "v", nullptr},
+        {kFile, nullptr, "v", nullptr},  {kFile, "", "v", nullptr},
+        {kFile, "k", nullptr, nullptr},  {kFile, "a=b", "v", nullptr},
+        {kFile, "a\nb", "v", nullptr},   {kFile, "#k", "v", nullptr},
+        {kFile, " k", "v", nullptr},     {kFile, "k", "two\nlines", nullptr},
+        {kFile, "k", "v", "%s"},         {kFile, "k", "v", "%s=%s=%s\n"},
+        {kFile, "k", "v", "%d=%s\n"},    {kFile, "k", "v", "%s=%s%n"},
+        {kFile, "k", "v", "%5s=%s\n"},   {kFile, "k", "v", "%s=%s%"},
         {kFile, "k", "v", "plain text"},
     };
     for (const Case& c : cases) {
@@ -227,16 +234,18 @@ TEST_F(KeyValueTest, ReaderInAnotherProcessNeverSeesATornOrMissingFile) {
         for (long i = 0; i < 50000000; ++i) {
             int n = KLIBCFileGetKeyValue(kFile, "value", buf.data(), buf.size(), 0);
             std::string got(buf.data());
-            if (n < 0 || (got != shortValue && got != longValue)) ++bad;
-            if (KLIBCFileGetKeyValue(kFile, "after", buf.data(), buf.size(), 0) != 1) ++bad;
-            if (KLIBCFileGetKeyValue(kFile, "stop", buf.data(), buf.size(), 0) == 3) break;
+            if (n < 0 || (got != shortValue && got != longValue))
+                ++bad;
+            if (KLIBCFileGetKeyValue(kFile, "after", buf.data(), buf.size(), 0) != 1)
+                ++bad;
+            if (KLIBCFileGetKeyValue(kFile, "stop", buf.data(), buf.size(), 0) == 3)
+                break;
         }
         return bad == 0 ? 0 : 1;
     });
     for (int i = 0; i < 3000; ++i) {
-        ASSERT_EQ(KLIBCFileSetKeyValue(kFile, "value", i % 2 ? shortValue.c_str()
-                                                             : longValue.c_str(),
-                                       nullptr),
+        ASSERT_EQ(KLIBCFileSetKeyValue(kFile, "value",
+                                       i % 2 ? shortValue.c_str() : longValue.c_str(), nullptr),
                   1);
     }
     ASSERT_EQ(KLIBCFileSetKeyValue(kFile, "stop", "yes", nullptr), 1);

@@ -45,9 +45,13 @@ TEST_F(ProcessTest, ExecPassesArgumentsUpToTheFirstNull) {
     EXPECT_EQ(KLIBCExec("/bin/sh", "-c", script, nullptr, "ignored"), 0);
     EXPECT_EQ(ReadFile("/tmp/args"), "/bin/sh|");  // $0 is argv[0], the program itself
 
-    char* argv[] = {const_cast<char*>("name"), const_cast<char*>("-c"),
-                    const_cast<char*>(script), const_cast<char*>("a"), const_cast<char*>(""),
-                    const_cast<char*>("$HOME"), nullptr};
+    char* argv[] = {const_cast<char*>("name"),
+                    const_cast<char*>("-c"),
+                    const_cast<char*>(script),
+                    const_cast<char*>("a"),
+                    const_cast<char*>(""),
+                    const_cast<char*>("$HOME"),
+                    nullptr};
     EXPECT_EQ(KLIBCExecv("/bin/sh", argv, 1), 0);
     EXPECT_EQ(ReadFile("/tmp/args"), "a||$HOME|");
 }
@@ -109,11 +113,23 @@ TEST_F(ProcessTest, ReadPidFileAcceptsOnlyPositiveNumbers) {
         const char* content;
         int pid;
     } cases[] = {
-        {"123", 123},     {"123\n", 123},   {"123 \n", 123}, {"7\r\n", 7},
-        {"", 0},          {"\n", 0},        {"abc", 0},      {"0", 0},
-        {"0\n", 0},       {"-5", 0},        {"+5", 0},       {" 5", 0},
-        {"12abc", 0},     {"12 34", 0},     {"2147483647", 2147483647},
-        {"2147483648", 0}, {"99999999999999999999", 0},
+        {"123", 123},
+        {"123\n", 123},
+        {"123 \n", 123},
+        {"7\r\n", 7},
+        {"", 0},
+        {"\n", 0},
+        {"abc", 0},
+        {"0", 0},
+        {"0\n", 0},
+        {"-5", 0},
+        {"+5", 0},
+        {" 5", 0},
+        {"12abc", 0},
+        {"12 34", 0},
+        {"2147483647", 2147483647},
+        {"2147483648", 0},
+        {"99999999999999999999", 0},
     };
     for (const Case& c : cases) {
         WriteFile(kPidFile, c.content);
@@ -154,7 +170,8 @@ TEST_F(ProcessTest, KillSendsTermOrKill) {
         // The child waits until signalled.
         pid_t child = kytotest::Spawn([] {
             signal(SIGTERM, SIG_DFL);
-            for (;;) pause();
+            for (;;)
+                pause();
             return 0;
         });
         WriteFile(kPidFile, std::to_string(child) + "\n");
@@ -165,10 +182,12 @@ TEST_F(ProcessTest, KillSendsTermOrKill) {
     pid_t stubborn = kytotest::Spawn([] {
         signal(SIGTERM, SIG_IGN);
         WriteFile("/tmp/ready", "");
-        for (;;) pause();
+        for (;;)
+            pause();
         return 0;
     });
-    for (int i = 0; i < 10000 && !kytotest::PathExists("/tmp/ready"); ++i) usleep(1000);
+    for (int i = 0; i < 10000 && !kytotest::PathExists("/tmp/ready"); ++i)
+        usleep(1000);
     ASSERT_TRUE(kytotest::PathExists("/tmp/ready"));
     WriteFile(kPidFile, std::to_string(stubborn));
     EXPECT_EQ(KLIBCKill(kPidFile, 0), 0);

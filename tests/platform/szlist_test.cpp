@@ -13,7 +13,7 @@
 namespace {
 
 class SzListTest : public kytotest::SandboxTest {
-protected:
+  protected:
     void TearDown() override {
         KLIBCSzListFree(list_);
         free(buf_);
@@ -21,7 +21,8 @@ protected:
     }
     std::vector<std::string> Items() const {
         std::vector<std::string> out;
-        for (int i = 0; i < list_->nItem; ++i) out.emplace_back(list_->pszItem[i]);
+        for (int i = 0; i < list_->nItem; ++i)
+            out.emplace_back(list_->pszItem[i]);
         return out;
     }
     PKLIBC_SZLIST list_ = nullptr;

@@ -32,6 +32,13 @@ int KLIBCErrLogSet(const char* logPath, const char* text);
  * Lines have the form key=value or key="value".  Blank lines and lines starting with '#'
  * are kept untouched.  A line may be at most KLIBC_KV_MAX_LINE bytes long (newline not
  * counted); a longer line makes the whole file unreadable (KYTO_ERR_LINE_TOO_LONG).
+ *
+ * Parsing: the key is the text before the first '=', the value everything after it.
+ * Blanks (space, tab, CR) around the key and around the value are ignored, then one pair
+ * of double quotes enclosing the whole value is removed (inner quotes stay).  A line whose
+ * first non-blank character is '#' is a comment; a line without '=' matches no key.
+ * A folder in place of the file is an unreadable file (KYTO_ERR_FILE_OPEN); a missing one
+ * gives KYTO_ERR_FILE_NOT_FOUND.
  */
 #define KLIBC_KV_MAX_LINE 65536
 
@@ -39,31 +46,41 @@ int KLIBCErrLogSet(const char* logPath, const char* text);
  * bytes and NUL-terminated.  Returns the number of bytes copied (an empty value reads as
  * 0), 0 when the key is absent, -1 when the file cannot be read or an argument is bad
  * (NULL pointer, empty key, size < 1, flags != 0).  On -1 buf is left untouched; when the
- * key is absent buf holds "". */
+ * key is absent buf holds "".  With size 1 nothing fits: buf is "" and the result 0. */
 int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags);
 /* Replaces the first line for key in place (or appends one), keeping every other line and
  * their order; creates the file (0644) when missing.  lineFormat is a printf format with
  * exactly two %s (key, value); NULL means "%s=\"%s\"\n".  The content is written to a
  * temporary file in the same folder and renamed over the old one, so a reader never sees
- * a torn or missing file.  Keys may not contain '=', '\n' or start with '#'; values may
- * not contain '\n'.  Returns 1 on success, -1 on error. */
+ * a torn or missing file.  Keys may not contain '=', '\n', start with '#' or begin or
+ * end with a blank; values may not contain '\n'.  A line made by a format without a
+ * trailing newline gets one.  An existing file keeps its permission bits (a symbolic link
+ * at path is replaced by a regular file); a new one is 0644.  Every other line, the last
+ * one's missing newline included, is kept byte for byte.  Writers are not serialised:
+ * of two concurrent updates the later rename wins.  Returns 1 on success, -1 on error
+ * (the temporary file is always removed). */
 int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
                          const char* lineFormat);
-/* 1 when the path exists (file or folder, symbolic links followed), 0 otherwise. */
+/* 1 when the path exists (file or folder, symbolic links followed), 0 otherwise (NULL:
+ * 0 with KYTO_ERR_BAD_PARAMETER; a path that does not exist is not an error). */
 int KLIBCFileExist(const char* path);
 
 /* ---- Processes ---------------------------------------------------------------------- */
 
 /* fork, exec prog with the non-NULL arguments (the first NULL ends the list; no shell),
- * wait.  The child's standard input is /dev/null.  Returns the exit status 0..255; -1
- * when it cannot fork or wait, or the child died by a signal.  A program that cannot be
- * executed exits with 127. */
+ * wait.  argv[0] is prog.  The child's standard input is /dev/null, its signal mask is
+ * cleared; other descriptors are inherited as they are (every descriptor of this library
+ * is close-on-exec).  Returns the exit status 0..255; -1 when it cannot fork or wait, or
+ * the child died by a signal (KYTO_ERR_EXEC).  A program that cannot be executed exits
+ * with 127. */
 int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4);
 /* The same with a NULL-terminated argv (argv[0] included).  With blWait 0 the child's pid
  * is returned without waiting (the caller reaps it). */
 int KLIBCExecv(const char* prog, char* const argv[], int blWait);
 /* The decimal pid held in the file; 0 when the content is not a positive number; -1 when
- * the file is missing or unreadable. */
+ * the file is missing or unreadable.  Accepted content: digits only, optionally followed
+ * by blanks and newlines, value 1..INT_MAX; anything else (leading blanks, a sign, other
+ * text, more than 64 bytes) gives 0 with KYTO_ERR_NOT_FOUND. */
 int KLIBCReadPidFile(const char* path);
 /* 1 when the pid in the file names a live process (signal 0 succeeds), 0 otherwise. */
 int KLIBCIsProcAlive(const char* pidFile);

@@ -40,13 +40,16 @@ typedef struct _tag_KYTO_VOLUME_INFO {
 } KYTO_VOLUME_INFO, *PKYTO_VOLUME_INFO;
 
 /* Linked list of the data volumes in /proc/mounts order.  NULL when there are none (last
- * error KYTO_ERR_NOT_FOUND) or on error (another code).  flags must be 0. */
+ * error KYTO_ERR_NOT_FOUND) or on error (another code; a volume that cannot be queried
+ * with statvfs gives KYTO_ERR_SYSTEM).  flags must be 0.  A mount point mounted over more
+ * than once is listed once, at its first position, as the last (visible) mount.  Escaped
+ * characters in /proc/mounts (\040 ...) are decoded. */
 PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags);
 /* Frees the list from node on; NULL is fine. */
 void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node);
 /* Fills out[0] with the first writable data volume whose free bytes are greater than
- * minFree.  count is the number of entries out can hold (at least 1).  1 found, 0 none,
- * -1 error. */
+ * minFree.  count is the number of entries out can hold (at least 1).  1 found, 0 none
+ * (no data volume at all is "none", not an error), -1 error. */
 int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count);
 /* Creates the folder and its missing parents with mode; 0 ok (also when it already exists
  * as a folder), -1 error. */
@@ -56,7 +59,8 @@ int KYTOFSMkdirP(const char* path, mode_t mode);
 
 #define KYTO_HA_STATUS_PATH "/var/run/kytoha.status"
 
-/* 1 when /var/run/kytoha.status says running="yes", else 0. */
+/* 1 when /var/run/kytoha.status says running="yes", else 0 (a status file that exists
+ * but cannot be read also gives 0, with the last error set). */
 int KYTOHAIsRunning(void);
 /* 1 when the file says hybrid_dl="yes", with partner_unique copied into the buffer (cut to
  * size - 1); 0 when not hybrid (or no file); -1 when the file exists but cannot be read,
@@ -70,7 +74,9 @@ int KYTOHAIsHybridDL(char* partnerUnique, int size);
 
 /* 1: runs every /usr/kyto/etc/rc.d/S*.sh with "stop", highest name first; 2: every one
  * with "start", in name order.  Blocks until done; 0 ok, -1 bad action or no script
- * folder. */
+ * folder.  Names are ordered bytewise (not by locale); only regular files are run, each
+ * directly with execv.  As in an init system, a script that fails or cannot be executed
+ * does not stop the others and does not change the result. */
 int KYTOServiceOnOffALL(int action);
 /* Runs /usr/kyto/bin/kytopkg with "startall" (blStart != 0) or "stopall"; returns its
  * exit status, -1 when it cannot run. */
