@@ -10,7 +10,7 @@
 #include <kytoplatform/kytoconf.h>
 
 class SmallUpdate {
-public:
+  public:
     // Download state, written as a number into "/var/run/downloadVYX.status".
     enum DOWNLOAD_STATUS {
         DOWNLOAD_STATUS_NONE = 0,

@@ -1,0 +1,301 @@
+// The small-update record: constructors, Equal, the info files, the download status
+// writer and the folder helpers.
+#include <syslog.h>
+
+#include <algorithm>
+#include <functional>
+#include <map>
+#include <tuple>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+#include <json/json.h>
+
+#include "sandbox.h"
+#include "smallupdate.h"
+
+using namespace kytotest;
+
+namespace {
+
+const char* const kInfo = "/autoupd@te.info";
+const char* const kPassive = "/passive_upd@te.info";
+
+Json::Value Parse(const std::string& text) {
+    Json::Value v;
+    EXPECT_TRUE(Json::Reader().parse(text, v, false)) << text;
+    return v;
+}
+
+// An info file as a download on the sandbox's build 5644 writes it.
+const char* const kValidInfo =
+    R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
+    R"("debDir":"/volume1/d","smallupdateDeb":"smallfix_6.1-5644-s3_all.deb",)"
+    R"("vyxServiceRestartList":["S20samba.sh"],"pkgRestartList":[]})";
+
+// A record that dumps cleanly: one small-update package with its link.
+SmallUpdate Dumpable() {
+    SmallUpdate u;
+    u.m_buildNumber = 5644;
+    u.m_newSmallFixNumber = 7;
+    u.m_debDir = "/volume1/d";
+    u.m_smallUpdateDeb = "smallfix_6.1-5644-s7_all.deb";
+    u.m_smallUpdateDebLink = "http://127.0.0.1/s7";
+    return u;
+}
+
+class SmallUpdateInfoTest : public SandboxTest {};
+
+TEST_F(SmallUpdateInfoTest, ConstructorsAndEqual) {
+    SmallUpdate plain;
+    EXPECT_EQ("demo_model", plain.m_unique);
+    EXPECT_EQ(std::make_pair(-1, -1),
+              std::make_pair(plain.m_newSmallFixNumber, plain.m_buildNumber));
+    EXPECT_EQ("other", SmallUpdate("other").m_unique);
+    EXPECT_EQ("demo_model", SmallUpdate(std::string()).m_unique);
+    SetKeyValue("/etc.defaults/kytoinfo.conf", "unique", std::nullopt);
+    EXPECT_EQ("", SmallUpdate().m_unique);
+
+    SmallUpdate base = Dumpable();
+    base.m_installDebs = {"a", "b"};
+    using Change = std::function<void(SmallUpdate&)>;
+    const std::vector<std::pair<Change, bool>> rows = {
+        {[](SmallUpdate& u) { u.m_unique = u.m_smallUpdateDebLink = u.m_flashUpdateDebLink = "x"; },
+         true},
+        {[](SmallUpdate& u) { u.m_buildNumber = u.m_errno = 1; }, true},
+        {[](SmallUpdate& u) {
+             u.m_installDebs = {"b", "a"};
+         },
+         true},
+        {[](SmallUpdate& u) { u.m_blConfigUpdate = true; }, false},
+        {[](SmallUpdate& u) { u.m_blFlashUpdate = true; }, false},
+        {[](SmallUpdate& u) { u.m_newSmallFixNumber = 8; }, false},
+        {[](SmallUpdate& u) { u.m_debDir += "x"; }, false},
+        {[](SmallUpdate& u) { u.m_installDebLinks = {"l"}; }, false},
+        {[](SmallUpdate& u) { u.m_smallUpdateDeb = "z"; }, false},
+        {[](SmallUpdate& u) { u.m_flashUpdateDeb = "z"; }, false},
+        {[](SmallUpdate& u) {
+             u.m_installDebs = {"a", "a"};
+         },
+         false},
+        {[](SmallUpdate& u) { u.m_blRestartAllService = true; }, false},
+        {[](SmallUpdate& u) { u.m_blNeedReboot = true; }, false},
+        {[](SmallUpdate& u) { u.m_vyxServiceRestartList = {"S99sshd.sh"}; }, false},
+        {[](SmallUpdate& u) { u.m_pkgRestartList = {"pkg"}; }, false},
+    };
+    for (size_t i = 0; i < rows.size(); ++i) {
+        SmallUpdate other = base;
+        rows[i].first(other);
+        EXPECT_EQ(rows[i].second, base.Equal(other)) << "row " << i;
+    }
+}
+
+TEST_F(SmallUpdateInfoTest, ImportFillsTheRecord) {
+    Json::Value v = Parse(kValidInfo);
+    v["flashupdateDeb"] = "flash_6.1-5644-s3_all.deb";
+    v["configUpdate"] = true;
+    v["installDeb"] = Parse(R"(["b_6.1-5644-s2_all.deb"])");
+    v["installDeb"].append(std::string(3000, 'a') + "_6.1-5644-s1_all.deb");  // long, valid
+    WriteFile(kInfo, Json::FastWriter().write(v));
+    SmallUpdate u;
+    u.m_errno = 6;
+    ASSERT_TRUE(u.ImportInfoFile(kInfo));
+    EXPECT_EQ(0, u.GetErrno());
+    EXPECT_EQ(5644, u.m_buildNumber);
+    EXPECT_EQ(3, u.m_newSmallFixNumber);
+    EXPECT_EQ("/volume1/d", u.m_debDir);
+    EXPECT_EQ("smallfix_6.1-5644-s3_all.deb", u.m_smallUpdateDeb);
+    EXPECT_TRUE(u.m_blFlashUpdate && u.m_blConfigUpdate);
+    EXPECT_FALSE(u.m_blNeedReboot || u.m_blRestartAllService);
+    EXPECT_EQ(2u, u.m_installDebs.size());
+    EXPECT_EQ(std::vector<std::string>{"S20samba.sh"}, u.m_vyxServiceRestartList);
+
+    // Reboot flag only, no installDeb: empty lists; a flash flag set before is kept.
+    WriteFile(kInfo, R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
+                     R"("debDir":"/d","smallupdateDeb":"s.deb","blNeedReboot":true})");
+    SmallUpdate m;
+    m.m_installDebs = {"stale"};
+    m.m_blFlashUpdate = true;
+    ASSERT_TRUE(m.ImportInfoFile(kInfo));
+    EXPECT_TRUE(m.m_installDebs.empty() && m.m_pkgRestartList.empty());
+    EXPECT_TRUE(m.m_blNeedReboot && m.m_blFlashUpdate);
+}
+
+TEST_F(SmallUpdateInfoTest, ImportRejectsBadFiles) {
+    struct Row {
+        const char* key;
+        const char* json;  // new value, nullptr removes the key
+        int err;
+        int build;        // m_buildNumber afterwards: stored once the build matched
+        const char* log;  // expected syslog text, "" for none
+    } rows[] = {
+        {"updateType", R"("vyxupdate")", 3, -1, ""},
+        {"updateType", "[]", 3, -1, ""},
+        {"updateType", nullptr, 3, -1, ""},
+        {"buildnumber", R"("5644")", 3, -1, ""},
+        {"buildnumber", "5644.5", 3, -1, ""},
+        {"newSmallFixNumber", nullptr, 3, -1, ""},
+        {"newSmallFixNumber", "true", 3, -1, ""},
+        {"debDir", "7", 3, -1, ""},
+        {"smallupdateDeb", nullptr, 3, -1, ""},  // no package named
+        {"smallupdateDeb", "5", 3, -1, ""},
+        {"pkgRestartList", nullptr, 3, -1, ""},  // restart behaviour not stated
+        {"buildnumber", "5645", 4, -1, ""},
+        {"installDeb", "{}", 3, 5644, ""},
+        {"installDeb", R"(["a_6.1-5644-s1_all.deb", 1])", 3, 5644, ""},
+        {"installDeb", R"(["foo.deb"])", 3, 5644, "format error of debian [foo.deb]"},
+        {"installDeb", R"(["f_6.1-5643-s1_all.deb"])", 3, 5644, "error of debian [f_6.1-5643"},
+        {"installDeb", R"(["f_x_6.1-5644-s1_all.deb"])", 3, 5644, "error of debian [f_x_6.1"},
+        {"vyxServiceRestartList", R"("S20samba.sh")", 3, 5644, ""},
+        {"pkgRestartList", "[1]", 3, 5644, ""},
+    };
+    for (const Row& row : rows) {
+        Json::Value v = Parse(kValidInfo);
+        if (row.json) {
+            v[row.key] = Parse(row.json);
+        } else {
+            v.removeMember(row.key);
+        }
+        WriteFile(kInfo, Json::FastWriter().write(v));
+        ClearSyslog();
+        SmallUpdate u;
+        u.m_installDebs = {"kept"};
+        EXPECT_FALSE(u.ImportInfoFile(kInfo)) << row.key << row.json;
+        EXPECT_EQ(row.err, u.GetErrno()) << row.key << row.json;
+        EXPECT_TRUE(*row.log == '\0' || SyslogContains(row.log, LOG_ERR)) << row.log;
+        EXPECT_EQ(row.build, u.m_buildNumber) << row.key << row.json;
+        if (std::string(row.key) == "installDeb") {  // the list is taken only when all pass
+            EXPECT_EQ(std::vector<std::string>{"kept"}, u.m_installDebs);
+        }
+    }
+    const std::string longName = std::string(5000, 'z') + ".deb";
+    WriteFile(kInfo,
+              std::string(kValidInfo).replace(1, 0, "\"installDeb\":[\"" + longName + "\"],"));
+    EXPECT_FALSE(SmallUpdate().ImportInfoFile(kInfo));
+    EXPECT_TRUE(SyslogContains("format error of debian [zzzz", LOG_ERR));
+
+    for (const char* text : {"[1,2]", "\"smallupdate\"", "null", "{\"updateType\":", "garbage"}) {
+        WriteFile(kInfo, text);
+        SmallUpdate u;
+        EXPECT_FALSE(u.ImportInfoFile(kInfo)) << text;
+        EXPECT_EQ(3, u.GetErrno()) << text;
+    }
+    SmallUpdate u;
+    EXPECT_FALSE(u.ImportInfoFile("/no/such/info"));
+    EXPECT_EQ(3, u.GetErrno());
+    ClearSyslog();
+    EXPECT_FALSE(u.ImportInfoFile(nullptr));
+    EXPECT_TRUE(SyslogContains("smallupdate:", LOG_ERR) && SyslogContains(" bad parameter!"));
+}
+
+TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
+    // reboot, restart-all -> the keys that must be present
+    const std::vector<std::tuple<bool, bool, std::string>> rows = {
+        {true, true, R"(["blNeedReboot"])"},
+        {false, true, R"(["blRestartAllService"])"},
+        {false, false, R"(["pkgRestartList","vyxServiceRestartList"])"},
+    };
+    const std::vector<std::string> fixed = {"buildnumber", "debDir", "newSmallFixNumber",
+                                            "smallupdateDeb", "updateType"};
+    for (const auto& [reboot, restartAll, keys] : rows) {
+        SmallUpdate u = Dumpable();
+        u.m_blNeedReboot = reboot;
+        u.m_blRestartAllService = restartAll;
+        ASSERT_TRUE(u.DumpToInfoFile(false));
+        Json::Value v = Parse(ReadFile(kInfo).value_or(""));
+        std::vector<std::string> expected = fixed;
+        for (const auto& k : Parse(keys))
+            expected.push_back(k.asString());
+        std::sort(expected.begin(), expected.end());
+        EXPECT_EQ(expected, v.getMemberNames()) << keys;
+    }
+    EXPECT_EQ(R"({"buildnumber":5644,"debDir":"/volume1/d","newSmallFixNumber":7,)"
+              R"("pkgRestartList":[],"smallupdateDeb":"smallfix_6.1-5644-s7_all.deb",)"
+              R"("updateType":"smallupdate","vyxServiceRestartList":[]})"
+              "\n",
+              ReadFile(kInfo).value_or(""));
+
+    SmallUpdate u = Dumpable();
+    u.m_blConfigUpdate = u.m_blFlashUpdate = true;
+    u.m_flashUpdateDeb = "flash_6.1-5644-s7_all.deb";
+    u.m_flashUpdateDebLink = "http://127.0.0.1/f";
+    u.m_installDebs = {"b_6.1-5644-s5_all.deb", "a_6.1-5644-s6_all.deb"};
+    u.m_vyxServiceRestartList = {"S20samba.sh"};
+    u.m_pkgRestartList = {"pkgA", "pkgB"};
+    ASSERT_TRUE(u.DumpToInfoFile(false));
+    SmallUpdate back;
+    ASSERT_TRUE(back.ImportInfoFile(kInfo));
+    EXPECT_TRUE(back.Equal(u));
+    EXPECT_EQ(5644, back.m_buildNumber);
+
+    // Passive: stored under debDir, naming the fixed folder; the marker names debDir.
+    u.m_debDir = "/volume1/passive";
+    WriteFile(u.m_debDir + "/keep", "");
+    RemoveTree(kInfo);
+    ASSERT_TRUE(u.DumpToInfoFile(true));
+    EXPECT_FALSE(PathExists(kInfo));
+    auto passive = Parse(ReadFile("/volume1/passive/autoupd@te.info").value_or(""));
+    EXPECT_EQ("/@smallupd@te_deb", passive["debDir"].asString());
+    EXPECT_EQ((std::map<std::string, std::string>{{"debDir", "/volume1/passive"}}),
+              ReadKeyValueFile(kPassive));
+}
+
+TEST_F(SmallUpdateInfoTest, DumpFailuresLeaveNoInfoFiles) {
+    struct Row {
+        std::function<void(SmallUpdate&)> change;
+        bool passive;
+        std::string log;
+    } rows[] = {
+        {[](SmallUpdate& u) { u.m_smallUpdateDeb = u.m_smallUpdateDebLink = ""; }, false,
+         "no flash and smallupdate or others debian file[0x"},
+        {[](SmallUpdate& u) { u.m_smallUpdateDebLink = ""; }, false,
+         "bad smallupdate debian [smallfix_6.1-5644-s7_all.deb][][0x"},
+        {[](SmallUpdate& u) { u.m_flashUpdateDeb = "f.deb"; }, false,
+         "bad flashupdate debian[f.deb][]"},
+        {[](SmallUpdate& u) { u.m_debDir = "/no/dir"; }, true,
+         "failed to dump json to file [/no/dir/autoupd@te.info]"},
+        {[](SmallUpdate& u) { u.m_debDir = "/volume1/a\nb"; }, true,
+         "failed to set debDri=/volume1/a"},
+    };
+    for (const Row& row : rows) {
+        WriteFile(kInfo, "{}");
+        WriteFile(kPassive, "debDir=\"/old\"\n");
+        SmallUpdate u = Dumpable();
+        row.change(u);
+        ClearSyslog();
+        EXPECT_FALSE(u.DumpToInfoFile(row.passive)) << row.log;
+        EXPECT_FALSE(PathExists(kInfo) || PathExists(kPassive)) << row.log;
+        EXPECT_TRUE(SyslogContains(row.log, LOG_ERR)) << row.log;
+    }
+}
+
+TEST_F(SmallUpdateInfoTest, DownloadProgressAndFolders) {
+    const std::string path = "/var/run/downloadVYX.status";
+    ASSERT_EQ(1, SmallUpdate::UpdateDownloadProgress(0, SmallUpdate::DOWNLOAD_STATUS_INIT));
+    ASSERT_EQ(1, SmallUpdate::UpdateDownloadProgress(42, SmallUpdate::DOWNLOAD_STATUS_DOWNLOADING));
+    EXPECT_EQ((std::map<std::string, std::string>{
+                  {"updateType", "smallupdate"}, {"percentage", "42"}, {"downloadStatus", "2"}}),
+              ReadKeyValueFile(path));
+    const std::string text = ReadFile(path).value_or("");
+    EXPECT_NE(std::string::npos, text.find("percentage=\"42\"\ndownloadStatus=\"2\"\n"));
+    RemoveTree(path);
+    Shell("mkdir -p " + path);  // a folder in the way: nothing can be written
+    EXPECT_EQ(0, SmallUpdate::UpdateDownloadProgress(0, SmallUpdate::DOWNLOAD_STATUS_STOPPED));
+
+    MountVolume("/volume2", 209715200ULL);  // exactly the 200 MiB a download needs
+    SmallUpdate u;
+    std::string folder;
+    ASSERT_TRUE(u.GetSourceDir(folder, "@smallupd@te_deb"));
+    EXPECT_EQ("/volume2/@smallupd@te_deb", folder);
+
+    WriteFile("/volume2/d/a.deb", "x");
+    EXPECT_TRUE(SmallUpdate::FilesExist("/volume2/d", std::vector<std::string>{"a.deb", ""}));
+    EXPECT_TRUE(SmallUpdate::FilesExist("/volume2/d", std::vector<std::string>{}));
+    ClearSyslog();
+    EXPECT_FALSE(SmallUpdate::FilesExist("/volume2/d", {"a.deb", "c.deb", "e.deb"}));
+    EXPECT_TRUE(SyslogContains("can't access [/volume2/d/c.deb]", LOG_ERR));
+    EXPECT_FALSE(SyslogContains("e.deb"));  // stops at the first missing file
+}
+
+}  // namespace
