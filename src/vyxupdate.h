@@ -62,7 +62,7 @@ enum _tag_update_step_ {
 };
 
 class VyxUpdate {
-public:
+  public:
     // In-memory download state of the full release (never written to a file as a number).
     enum VYX_DOWNLOAD_STATUS {
         VYX_DOWNLOAD_STATUS_NONE = 0,
@@ -129,6 +129,14 @@ public:
     std::string m_partnerUnique;
     _tag_vyxinfo_ m_release;
     _tag_vyxinfo_ m_partnerRelease;
+
+  private:
+    // Steps 1-9 of DownloadVyx; the caller runs the end steps.  Fills the result record.
+    int DownloadImages(Json::Value& record, bool& cancelled);
+    // Sets one status key and logs the platform error when that fails.
+    static bool SetStatusKey(const char* key, const char* value);
+    // True unless the configured upgrade type is exactly "all".
+    static bool IsHotfixOnly();
 };
 
 #endif
