@@ -192,25 +192,29 @@ static int InReplacedFolder(const char* path) {
 }
 
 /*
- * Makes the folder of a file (program or script) visible at the same path in the new root.
- * The overlay's lower layer is only the root file system, not what is mounted below it:
- * when the file lives on another file system, the whole mount that holds it is bound
- * read-only.  When it lives in a folder the sandbox replaces (/tmp, /run), its own folder
- * is bound read-only.
+ * Makes a file (program or script) visible at the same path in the new root, together with
+ * what lies beside it (a build tree's shared libraries).  The overlay's lower layer is only
+ * the root file system, not what is mounted below it: when the file lives on another file
+ * system, the whole mount that holds it is bound read-only.  When it lives in a folder the
+ * sandbox replaces (/tmp, /run), the top folder holding it there (/tmp/<name>) is bound
+ * read-only.  `bound` keeps the last folder bound, so a second file in it binds nothing.
  */
-static void BindFileFolder(const char* file, const char* root) {
+static void BindFileFolder(const char* file, const char* root, char* bound) {
     struct stat rootSt, st;
     char dir[PATH_MAX];
     if (stat("/", &rootSt) != 0)
         Fail(NULL, "stat /");
     Path(dir, file, "");
-    char* slash = strrchr(dir, '/');
-    if (slash == NULL)
-        return;
-    *(slash == dir ? slash + 1 : slash) = '\0';
-    if (stat(dir, &st) != 0)
-        Fail(NULL, "stat %s", dir);
-    if (!InReplacedFolder(file)) {
+    if (InReplacedFolder(file)) {
+        char* second = strchr(dir + 1, '/');
+        char* third = strchr(second + 1, '/');
+        if (third != NULL)
+            *third = '\0';
+    } else {
+        char* slash = strrchr(dir, '/');
+        *(slash == dir ? slash + 1 : slash) = '\0';
+        if (stat(dir, &st) != 0)
+            Fail(NULL, "stat %s", dir);
         if (st.st_dev == rootSt.st_dev)
             return;
         /* Walk up to the top folder of that file system: its mount point. */
@@ -225,10 +229,24 @@ static void BindFileFolder(const char* file, const char* root) {
             Path(dir, parent, "");
         }
     }
+    size_t n = strlen(bound);
+    if (n > 0 && strncmp(dir, bound, n) == 0 && (dir[n] == '\0' || dir[n] == '/'))
+        return;
+    if (stat(dir, &st) != 0)
+        Fail(NULL, "stat %s", dir);
     char dst[PATH_MAX];
     Path(dst, root, dir);
-    MakeDirs(dst);
+    if (S_ISDIR(st.st_mode)) {
+        MakeDirs(dst);
+    } else {
+        char* slash = strrchr(dst, '/');
+        *slash = '\0';
+        MakeDirs(dst);
+        *slash = '/';
+        CreateFile(dst, 0644);
+    }
     BindReadOnly(dir, dst);
+    Path(bound, dir, "");
 }
 
 /* A scratch folder for the tmpfs that holds the overlay's upper layer: an existing folder
@@ -310,8 +328,9 @@ static void BuildRoot(const char* root_parent, const char* prog_real, const char
     Path(p, root, "/tmp");
     MakeDirs(p);
     Mount("tmpfs", p, "tmpfs", MS_NOSUID | MS_NODEV, "mode=1777", NULL);
-    BindFileFolder(prog_real, root);
-    BindFileFolder(script_real, root);
+    char bound[PATH_MAX] = "";
+    BindFileFolder(prog_real, root, bound);
+    BindFileFolder(script_real, root, bound);
 
     Path(p, root, "/.kyto-sandbox");
     CreateFile(p, 0644);

@@ -1,5 +1,7 @@
 // Self-tests of the sandbox root and the shared test helpers.
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/statfs.h>
 #include <sys/statvfs.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -56,6 +58,51 @@ TEST_F(SandboxSelfTest, WorkingFolderIsRootAndTmpIsSticky) {
     EXPECT_EQ(st.st_mode & 07777, 01777u);
     EXPECT_TRUE(IsDirectory("/var/run"));
     EXPECT_TRUE(IsDirectory("/var/log"));
+}
+
+TEST_F(SandboxSelfTest, ProcDevSysAreTheSandboxesOwn) {
+    // Own pid namespace: the launcher's init is pid 1 and no host process is visible.
+    EXPECT_EQ(ReadFile("/proc/1/comm").value_or(""), "kyto-sandbox\n");
+    std::string out;
+    ASSERT_EQ(Shell("ps -e -o comm= | sort -u | tr '\\n' ' '", &out), 0);
+    EXPECT_EQ(out, "kyto-sandbox ps sandbox_sandbox sh sort tr ");
+
+    // A private /dev: only the few nodes tests need, never the host's disks.
+    std::vector<std::string> dev = {"fd",  "full",   "log",   "null",   "ptmx", "pts",     "random",
+                                    "shm", "stderr", "stdin", "stdout", "tty",  "urandom", "zero"};
+    EXPECT_EQ(ListDir("/dev"), dev);
+    struct stat st;
+    ASSERT_EQ(stat("/dev/log", &st), 0);
+    EXPECT_TRUE(S_ISSOCK(st.st_mode));
+    EXPECT_EQ(Shell("echo x > /dev/null && head -c 4 /dev/urandom | wc -c | grep -qx 4"), 0);
+
+    // /sys and what is mounted below it are read-only; /tmp and /run are fresh and empty.
+    struct statvfs vfs;
+    ASSERT_EQ(statvfs("/sys", &vfs), 0);
+    EXPECT_NE(vfs.f_flag & ST_RDONLY, 0u);
+    if (statvfs("/sys/fs/cgroup", &vfs) == 0) {
+        EXPECT_NE(vfs.f_flag & ST_RDONLY, 0u);
+    }
+    EXPECT_TRUE(ListDir("/tmp").empty());
+    for (const char* dir : {"/tmp", "/run"}) {
+        struct statfs fs;
+        ASSERT_EQ(statfs(dir, &fs), 0);
+        EXPECT_EQ(fs.f_type, static_cast<decltype(fs.f_type)>(0x01021994)) << dir << " not tmpfs";
+    }
+}
+
+// Writes to the appliance paths land in the sandbox's overlay; scripts/test.sh checks after
+// the run that none of them appeared on the host.
+TEST_F(SandboxSelfTest, ApplianceWritesStayInsideTheSandbox) {
+    WriteFile("/autoupd@te.info", "{}");
+    WriteFile("/.upgrade_vol", "");
+    WriteFile("/var/run/downloadVYX.status", "percentage=\"1\"\n");
+    WriteFile("/var/log/kytoupdate.log", "x\n");
+    SetKeyValue("/etc.defaults/VERSION", "smallfixnumber", std::string("9"));
+    EXPECT_EQ(ReadKeyValueFile("/etc.defaults/VERSION")["smallfixnumber"], "9");
+    EXPECT_EQ(ReadKeyValueFile("/var/run/downloadVYX.status")["percentage"], "1");
+    std::string mounts = ReadFile("/proc/self/mounts").value_or("");
+    EXPECT_EQ(mounts.rfind("overlay / overlay ", 0), 0u) << mounts;
 }
 
 TEST_F(SandboxSelfTest, RecordingScriptsKeepArgumentsAndHonourExitOverride) {

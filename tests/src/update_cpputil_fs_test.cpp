@@ -11,12 +11,6 @@
 #include "sandbox.h"
 #include "update_cpputil.h"
 
-// IsThereAvailVolPath releases the volume list only from the node where its walk stopped;
-// the nodes before it (all of them when no volume qualified) stay allocated on purpose.
-extern "C" const char* __lsan_default_suppressions() {
-    return "leak:IsThereAvailVolPath\n";
-}
-
 namespace {
 
 using kytotest::IsDirectory;

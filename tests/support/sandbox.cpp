@@ -330,14 +330,16 @@ bool IsDirectory(const std::string& path) {
 void RemoveTree(const std::string& path) {
     if (!PathExists(path))
         return;
-    // Depth first, no symbolic links followed, never into another mounted file system.
+    // Depth first, no symbolic links followed.  FTW_MOUNT is not usable here: on the
+    // sandbox's overlay root, files copied up or left in the lower layer report another
+    // device number than their folder.
     nftw(
         path.c_str(),
         [](const char* p, const struct stat*, int, struct FTW*) {
             remove(p);
             return 0;
         },
-        16, FTW_DEPTH | FTW_PHYS | FTW_MOUNT);
+        16, FTW_DEPTH | FTW_PHYS);
     if (PathExists(path))
         ADD_FAILURE() << "cannot remove " << path;
 }

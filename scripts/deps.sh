@@ -1,0 +1,29 @@
+# Debian packages needed to build and test the project; sourced by build.sh and test.sh.
+# Installs only what is missing, so a second run does not touch apt at all.
+KYTO_BUILD_PACKAGES=(cmake g++ make pkg-config libjsoncpp-dev libcurl4-openssl-dev)
+KYTO_TEST_PACKAGES=(googletest libgtest-dev libgmock-dev libbenchmark-dev wget openssl tar
+    dpkg dpkg-dev python3 util-linux clang-format ca-certificates)
+
+kyto_install_packages() {
+    local missing=() pkg
+    for pkg in "$@"; do
+        if ! dpkg-query -W -f='${Status}' "$pkg" 2>/dev/null | grep -q 'install ok installed'; then
+            missing+=("$pkg")
+        fi
+    done
+    if [ ${#missing[@]} -eq 0 ]; then
+        echo "== packages: all ${#} present"
+        return 0
+    fi
+    echo "== packages: installing ${missing[*]}"
+    export DEBIAN_FRONTEND=noninteractive
+    apt-get update -qq
+    apt-get install -y -qq --no-install-recommends "${missing[@]}" >/dev/null
+}
+
+kyto_require_root() {
+    if [ "$(id -u)" -ne 0 ]; then
+        echo "$0: must run as root (package installation and the test sandbox need it)" >&2
+        exit 1
+    fi
+}

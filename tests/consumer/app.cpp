@@ -1,0 +1,56 @@
+// A program built outside the source tree against the installed library, through
+// pkg-config only: proves that the installed headers and libraries are complete.
+//   g++ app.cpp $(pkg-config --cflags --libs kytoinstallcpp)
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include <string>
+#include <vector>
+
+#include <custombugfix.h>
+#include <debian_lib.h>
+#include <smallupdate.h>
+#include <systemupdate.h>
+#include <update_cpputil.h>
+#include <vyxupdate.h>
+#include <kytoplatform/klibc.h>
+
+static int g_failures = 0;
+
+static void Check(bool ok, const char* what) {
+    printf("%-58s %s\n", what, ok ? "ok" : "FAILED");
+    if (!ok)
+        ++g_failures;
+}
+
+int main() {
+    std::vector<std::string> a = {"samba", "nfs", "samba"};
+    std::vector<std::string> b = {"nfs", "samba", "samba"};
+    std::vector<std::string> c = {"nfs", "samba"};
+    Check(UpdateUtil::CompareVector(a, b) == 1, "CompareVector: same strings in another order");
+    Check(UpdateUtil::CompareVector(a, c) == 0, "CompareVector: different multiplicities");
+
+    VyxUpdate::VYX_DOWNLOAD_STATUS st = VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING;
+    Check(VyxUpdate::DownloadStatusToString(st) == "downloading",
+          "DownloadStatusToString(downloading)");
+    st = VyxUpdate::VYX_DOWNLOAD_STATUS_FAILED;
+    Check(VyxUpdate::DownloadStatusToString(st) == "failed", "DownloadStatusToString(failed)");
+
+    PKLIBC_SZLIST list = KLIBCSzListAlloc(2);
+    Check(list != nullptr, "KLIBCSzListAlloc(2)");
+    if (list != nullptr) {
+        int n = KLIBCStrSep("a,b,c", ",", &list);
+        char* joined = nullptr;
+        int size = 0;
+        int len = KLIBCSzListJoin(list, "+", &joined, &size);
+        Check(n == 3 && len == 5 && joined != nullptr && strcmp(joined, "a+b+c") == 0,
+              "KLIBCStrSep + KLIBCSzListJoin");
+        free(joined);
+        KLIBCSzListFree(list);
+    }
+    Check(KLIBCSzListAlloc(0) == nullptr, "KLIBCSzListAlloc(0) refused");
+
+    printf("consumer: %s\n", g_failures == 0 ? "all checks passed" : "checks FAILED");
+    return g_failures == 0 ? 0 : 1;
+}
