@@ -1,6 +1,6 @@
 #!/usr/bin/env bash
 # Builds and installs the library and the platform layer (default prefix /usr/local).
-# Run as root on a Debian machine:  sudo bash scripts/build.sh
+# Run as root on a Debian machine:  bash scripts/build.sh
 set -euo pipefail
 cd "$(dirname "$0")/.."
 source scripts/deps.sh

@@ -2,8 +2,8 @@
 # Builds the project and runs every test, each test case in its own sandbox root
 # (tests/sandbox/kyto-sandbox).  Run as root on a Debian machine:
 #
-#   sudo bash scripts/test.sh              build/, install + consumer check, all tests
-#   sudo bash scripts/test.sh --sanitize   build-asan/ with AddressSanitizer and
+#   bash scripts/test.sh              build/, install + consumer check, all tests
+#   bash scripts/test.sh --sanitize   build-asan/ with AddressSanitizer and
 #                                          UndefinedBehaviorSanitizer, all tests
 #
 # Afterwards the host's appliance paths are checked: a test run must not create any of them
