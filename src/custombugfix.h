@@ -10,7 +10,7 @@
 #include <json/json.h>
 
 class CustomBugFix {
-public:
+  public:
     explicit CustomBugFix(int curSmallFixNumber);
 
     // Folds one patch-list entry in; 1 success, 0 failure.

@@ -7,7 +7,7 @@
 #include <string>
 
 class DebianLib {
-public:
+  public:
     // Appends "<local time>\t<text>" to logPath.
     static void WriteUpdateLog(const std::string& text, const std::string& logPath);
     // Runs /usr/bin/dpkg <option> <package> [<folder>]; true unless it exited non-zero.

@@ -39,6 +39,7 @@ std::string ReadAll(FILE* f) {
 
 int UpdateUtil::ParseJsonRootFromFile(const char* path, Json::Value& root) {
     if (!path) {
+        KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, __FILE__, __LINE__);
         syslog(LOG_ERR, "%s:%d bad parameters!", kModule, __LINE__);
         return 0;
     }
@@ -65,6 +66,7 @@ int UpdateUtil::ParseJsonRootFromFile(const char* path, Json::Value& root) {
 
 int UpdateUtil::DumpJsonRootToFile(const char* path, const Json::Value& root) {
     if (!path) {
+        KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, __FILE__, __LINE__);
         syslog(LOG_ERR, "%s:%d bad parameter!", kModule, __LINE__);
         return 0;
     }

@@ -122,6 +122,15 @@ std::string JsonText(const Json::Value& value) {
     return std::string();
 }
 
+// Text of one member of an info object.  Read through a const reference so that a missing
+// member is not added to the caller's object, and guarded because jsoncpp throws when a
+// member is looked up on anything but an object or null.
+std::string MemberText(const Json::Value& object, const char* key) {
+    if (!object.isObject())
+        return std::string();
+    return JsonText(object[key]);
+}
+
 // Available bytes of the file system holding path, for unprivileged users.
 unsigned long long AvailableBytes(const struct statfs& st) {
     return static_cast<unsigned long long>(st.f_bavail) *
@@ -149,18 +158,16 @@ struct MntentClose {
     void operator()(FILE* f) const { endmntent(f); }
 };
 
-// Makes fd the descriptor target in a freshly forked child.  dup2 clears the
-// close-on-exec flag on the copy; when fd already is target the flag is cleared by hand.
-void MoveFdTo(int fd, int target) {
-    if (fd < 0)
-        return;
-    if (fd == target) {
-        int flags = fcntl(fd, F_GETFD);
-        if (flags >= 0)
-            fcntl(fd, F_SETFD, flags & ~FD_CLOEXEC);
-        return;
-    }
-    dup2(fd, target);
+// Opens path close-on-exec at a descriptor above the standard ones, so that making it the
+// child's standard error or output cannot overwrite the other one when the caller runs
+// with a standard descriptor closed.
+int OpenAboveStd(const char* path) {
+    int fd = open(path, O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    if (fd < 0 || fd > STDERR_FILENO)
+        return fd;
+    int moved = fcntl(fd, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
+    close(fd);
+    return moved;
 }
 
 }  // namespace
@@ -536,9 +543,9 @@ int VyxUpdate::CheckVyxRelease() {
     }
     if (have && m_haveNew) {
         char folder[4096];
-        snprintf(folder, sizeof(folder), "%s", JsonText(info["patchPath"]).c_str());
+        snprintf(folder, sizeof(folder), "%s", MemberText(info, "patchPath").c_str());
         std::string dir = dirname(folder);
-        if (ToNumber(JsonText(info["buildnumber"]).c_str()) != ToNumber(m_release.buildNum)) {
+        if (ToNumber(MemberText(info, "buildnumber").c_str()) != ToNumber(m_release.buildNum)) {
             // The recorded image belongs to an outdated release.
             if (!CleanDownloadResult(dir)) {
                 syslog(LOG_ERR, "%s:%d Fail to clean download result", kModule, __LINE__);
@@ -589,11 +596,11 @@ bool VyxUpdate::CheckPatchAndUpdateType(bool& isNewer, Json::Value& info) {
         return false;
     }
     snprintf(candidate.major, sizeof(candidate.major), "%s",
-             JsonText(info["majorversion"]).c_str());
+             MemberText(info, "majorversion").c_str());
     snprintf(candidate.minor, sizeof(candidate.minor), "%s",
-             JsonText(info["minorversion"]).c_str());
+             MemberText(info, "minorversion").c_str());
     snprintf(candidate.buildNum, sizeof(candidate.buildNum), "%s",
-             JsonText(info["buildnumber"]).c_str());
+             MemberText(info, "buildnumber").c_str());
     int newer = hotfixOnly ? IsHotfix(current, candidate) : IsVersionNewer(current, candidate);
     if (newer == 1)
         isNewer = true;
@@ -768,7 +775,7 @@ bool VyxUpdate::GetDownloadedPatchPath(bool& have, std::string& path) {
         return false;
     }
     if (have)
-        path = JsonText(info["patchPath"]);
+        path = MemberText(info, "patchPath");
     return true;
 }
 
@@ -786,14 +793,17 @@ bool VyxUpdate::ExecWgetP(std::string outputPath, std::string url, bool& cancell
     if (pid == 0) {
         // wget's progress goes to the progress log (read by GetDownloadPercentage), its
         // standard output is discarded.
-        int progress = open(kProgressLog, O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-        int devNull = open("/dev/null", O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-        MoveFdTo(progress, STDERR_FILENO);
-        MoveFdTo(devNull, STDOUT_FILENO);
-        if (progress > STDERR_FILENO)
+        // dup2 leaves close-on-exec off on the copies.
+        int progress = OpenAboveStd(kProgressLog);
+        int devNull = OpenAboveStd("/dev/null");
+        if (progress >= 0) {
+            dup2(progress, STDERR_FILENO);
             close(progress);
-        if (devNull > STDERR_FILENO)
+        }
+        if (devNull >= 0) {
+            dup2(devNull, STDOUT_FILENO);
             close(devNull);
+        }
         if (!WriteDownloadPidFile()) {
             syslog(LOG_ERR, "%s:%d Fail to write pid file", kModule, __LINE__);
             // Long-standing behaviour, kept deliberately: the child reports the failure

@@ -2,10 +2,8 @@
 // writer and the folder helpers.
 #include <syslog.h>
 
-#include <algorithm>
 #include <functional>
 #include <map>
-#include <tuple>
 #include <string>
 #include <vector>
 
@@ -21,6 +19,7 @@ namespace {
 
 const char* const kInfo = "/autoupd@te.info";
 const char* const kPassive = "/passive_upd@te.info";
+using Change = std::function<void(SmallUpdate&)>;
 
 Json::Value Parse(const std::string& text) {
     Json::Value v;
@@ -45,81 +44,40 @@ SmallUpdate Dumpable() {
     return u;
 }
 
-class SmallUpdateInfoTest : public SandboxTest {};
+using SmallUpdateInfoTest = SandboxTest;
 
 TEST_F(SmallUpdateInfoTest, ConstructorsAndEqual) {
-    SmallUpdate plain;
-    EXPECT_EQ("demo_model", plain.m_unique);
-    EXPECT_EQ(std::make_pair(-1, -1),
-              std::make_pair(plain.m_newSmallFixNumber, plain.m_buildNumber));
-    EXPECT_EQ("other", SmallUpdate("other").m_unique);
     EXPECT_EQ("demo_model", SmallUpdate(std::string()).m_unique);
+    EXPECT_EQ("other", SmallUpdate("other").m_unique);
     SetKeyValue("/etc.defaults/kytoinfo.conf", "unique", std::nullopt);
     EXPECT_EQ("", SmallUpdate().m_unique);
 
+    // Ignored fields and list order keep records equal; every compared field counts.
     SmallUpdate base = Dumpable();
     base.m_installDebs = {"a", "b"};
-    using Change = std::function<void(SmallUpdate&)>;
     const std::vector<std::pair<Change, bool>> rows = {
         {[](SmallUpdate& u) { u.m_unique = u.m_smallUpdateDebLink = u.m_flashUpdateDebLink = "x"; },
          true},
         {[](SmallUpdate& u) { u.m_buildNumber = u.m_errno = 1; }, true},
-        {[](SmallUpdate& u) {
-             u.m_installDebs = {"b", "a"};
-         },
-         true},
+        {[](SmallUpdate& u) { std::swap(u.m_installDebs[0], u.m_installDebs[1]); }, true},
         {[](SmallUpdate& u) { u.m_blConfigUpdate = true; }, false},
         {[](SmallUpdate& u) { u.m_blFlashUpdate = true; }, false},
         {[](SmallUpdate& u) { u.m_newSmallFixNumber = 8; }, false},
         {[](SmallUpdate& u) { u.m_debDir += "x"; }, false},
-        {[](SmallUpdate& u) { u.m_installDebLinks = {"l"}; }, false},
+        {[](SmallUpdate& u) { u.m_installDebLinks.push_back("l"); }, false},
         {[](SmallUpdate& u) { u.m_smallUpdateDeb = "z"; }, false},
         {[](SmallUpdate& u) { u.m_flashUpdateDeb = "z"; }, false},
-        {[](SmallUpdate& u) {
-             u.m_installDebs = {"a", "a"};
-         },
-         false},
+        {[](SmallUpdate& u) { u.m_installDebs[1] = "a"; }, false},
         {[](SmallUpdate& u) { u.m_blRestartAllService = true; }, false},
         {[](SmallUpdate& u) { u.m_blNeedReboot = true; }, false},
-        {[](SmallUpdate& u) { u.m_vyxServiceRestartList = {"S99sshd.sh"}; }, false},
-        {[](SmallUpdate& u) { u.m_pkgRestartList = {"pkg"}; }, false},
+        {[](SmallUpdate& u) { u.m_vyxServiceRestartList.push_back("S99sshd.sh"); }, false},
+        {[](SmallUpdate& u) { u.m_pkgRestartList.push_back("pkg"); }, false},
     };
     for (size_t i = 0; i < rows.size(); ++i) {
         SmallUpdate other = base;
         rows[i].first(other);
         EXPECT_EQ(rows[i].second, base.Equal(other)) << "row " << i;
     }
-}
-
-TEST_F(SmallUpdateInfoTest, ImportFillsTheRecord) {
-    Json::Value v = Parse(kValidInfo);
-    v["flashupdateDeb"] = "flash_6.1-5644-s3_all.deb";
-    v["configUpdate"] = true;
-    v["installDeb"] = Parse(R"(["b_6.1-5644-s2_all.deb"])");
-    v["installDeb"].append(std::string(3000, 'a') + "_6.1-5644-s1_all.deb");  // long, valid
-    WriteFile(kInfo, Json::FastWriter().write(v));
-    SmallUpdate u;
-    u.m_errno = 6;
-    ASSERT_TRUE(u.ImportInfoFile(kInfo));
-    EXPECT_EQ(0, u.GetErrno());
-    EXPECT_EQ(5644, u.m_buildNumber);
-    EXPECT_EQ(3, u.m_newSmallFixNumber);
-    EXPECT_EQ("/volume1/d", u.m_debDir);
-    EXPECT_EQ("smallfix_6.1-5644-s3_all.deb", u.m_smallUpdateDeb);
-    EXPECT_TRUE(u.m_blFlashUpdate && u.m_blConfigUpdate);
-    EXPECT_FALSE(u.m_blNeedReboot || u.m_blRestartAllService);
-    EXPECT_EQ(2u, u.m_installDebs.size());
-    EXPECT_EQ(std::vector<std::string>{"S20samba.sh"}, u.m_vyxServiceRestartList);
-
-    // Reboot flag only, no installDeb: empty lists; a flash flag set before is kept.
-    WriteFile(kInfo, R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
-                     R"("debDir":"/d","smallupdateDeb":"s.deb","blNeedReboot":true})");
-    SmallUpdate m;
-    m.m_installDebs = {"stale"};
-    m.m_blFlashUpdate = true;
-    ASSERT_TRUE(m.ImportInfoFile(kInfo));
-    EXPECT_TRUE(m.m_installDebs.empty() && m.m_pkgRestartList.empty());
-    EXPECT_TRUE(m.m_blNeedReboot && m.m_blFlashUpdate);
 }
 
 TEST_F(SmallUpdateInfoTest, ImportRejectsBadFiles) {
@@ -131,22 +89,14 @@ TEST_F(SmallUpdateInfoTest, ImportRejectsBadFiles) {
         const char* log;  // expected syslog text, "" for none
     } rows[] = {
         {"updateType", R"("vyxupdate")", 3, -1, ""},
-        {"updateType", "[]", 3, -1, ""},
-        {"updateType", nullptr, 3, -1, ""},
         {"buildnumber", R"("5644")", 3, -1, ""},
-        {"buildnumber", "5644.5", 3, -1, ""},
-        {"newSmallFixNumber", nullptr, 3, -1, ""},
         {"newSmallFixNumber", "true", 3, -1, ""},
-        {"debDir", "7", 3, -1, ""},
         {"smallupdateDeb", nullptr, 3, -1, ""},  // no package named
-        {"smallupdateDeb", "5", 3, -1, ""},
         {"pkgRestartList", nullptr, 3, -1, ""},  // restart behaviour not stated
         {"buildnumber", "5645", 4, -1, ""},
         {"installDeb", "{}", 3, 5644, ""},
-        {"installDeb", R"(["a_6.1-5644-s1_all.deb", 1])", 3, 5644, ""},
         {"installDeb", R"(["foo.deb"])", 3, 5644, "format error of debian [foo.deb]"},
         {"installDeb", R"(["f_6.1-5643-s1_all.deb"])", 3, 5644, "error of debian [f_6.1-5643"},
-        {"installDeb", R"(["f_x_6.1-5644-s1_all.deb"])", 3, 5644, "error of debian [f_x_6.1"},
         {"vyxServiceRestartList", R"("S20samba.sh")", 3, 5644, ""},
         {"pkgRestartList", "[1]", 3, 5644, ""},
     };
@@ -161,27 +111,22 @@ TEST_F(SmallUpdateInfoTest, ImportRejectsBadFiles) {
         ClearSyslog();
         SmallUpdate u;
         u.m_installDebs = {"kept"};
-        EXPECT_FALSE(u.ImportInfoFile(kInfo)) << row.key << row.json;
-        EXPECT_EQ(row.err, u.GetErrno()) << row.key << row.json;
+        const std::string what = std::string(row.key) + "=" + (row.json ? row.json : "(none)");
+        EXPECT_FALSE(u.ImportInfoFile(kInfo)) << what;
+        EXPECT_EQ(row.err, u.GetErrno()) << what;
         EXPECT_TRUE(*row.log == '\0' || SyslogContains(row.log, LOG_ERR)) << row.log;
-        EXPECT_EQ(row.build, u.m_buildNumber) << row.key << row.json;
+        EXPECT_EQ(row.build, u.m_buildNumber) << what;
         if (std::string(row.key) == "installDeb") {  // the list is taken only when all pass
-            EXPECT_EQ(std::vector<std::string>{"kept"}, u.m_installDebs);
+            EXPECT_EQ(std::vector<std::string>{"kept"}, u.m_installDebs) << what;
         }
     }
-    const std::string longName = std::string(5000, 'z') + ".deb";
-    WriteFile(kInfo,
-              std::string(kValidInfo).replace(1, 0, "\"installDeb\":[\"" + longName + "\"],"));
-    EXPECT_FALSE(SmallUpdate().ImportInfoFile(kInfo));
-    EXPECT_TRUE(SyslogContains("format error of debian [zzzz", LOG_ERR));
-
-    for (const char* text : {"[1,2]", "\"smallupdate\"", "null", "{\"updateType\":", "garbage"}) {
+    SmallUpdate u;
+    for (const char* text : {"[1,2]", "null", "{\"updateType\":"}) {
         WriteFile(kInfo, text);
-        SmallUpdate u;
         EXPECT_FALSE(u.ImportInfoFile(kInfo)) << text;
         EXPECT_EQ(3, u.GetErrno()) << text;
     }
-    SmallUpdate u;
+    u.m_errno = 0;
     EXPECT_FALSE(u.ImportInfoFile("/no/such/info"));
     EXPECT_EQ(3, u.GetErrno());
     ClearSyslog();
@@ -190,32 +135,30 @@ TEST_F(SmallUpdateInfoTest, ImportRejectsBadFiles) {
 }
 
 TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
-    // reboot, restart-all -> the keys that must be present
-    const std::vector<std::tuple<bool, bool, std::string>> rows = {
-        {true, true, R"(["blNeedReboot"])"},
-        {false, true, R"(["blRestartAllService"])"},
-        {false, false, R"(["pkgRestartList","vyxServiceRestartList"])"},
+    // jsoncpp writes the members sorted by name.
+    const std::string common = R"("buildnumber":5644,"debDir":"/volume1/d","newSmallFixNumber":7,)";
+    const std::string tail =
+        R"("smallupdateDeb":"smallfix_6.1-5644-s7_all.deb","updateType":"smallupdate")";
+    struct Row {
+        bool reboot, restartAll;
+        std::string expected;
+    } rows[] = {
+        {true, true, R"({"blNeedReboot":true,)" + common + tail + "}\n"},
+        {false, true, R"({"blRestartAllService":true,)" + common + tail + "}\n"},
+        {false, false,
+         "{" + common + R"("pkgRestartList":[],)" + tail + R"(,"vyxServiceRestartList":[]})" +
+             "\n"},
     };
-    const std::vector<std::string> fixed = {"buildnumber", "debDir", "newSmallFixNumber",
-                                            "smallupdateDeb", "updateType"};
-    for (const auto& [reboot, restartAll, keys] : rows) {
+    for (const Row& row : rows) {
         SmallUpdate u = Dumpable();
-        u.m_blNeedReboot = reboot;
-        u.m_blRestartAllService = restartAll;
+        u.m_blNeedReboot = row.reboot;
+        u.m_blRestartAllService = row.restartAll;
         ASSERT_TRUE(u.DumpToInfoFile(false));
-        Json::Value v = Parse(ReadFile(kInfo).value_or(""));
-        std::vector<std::string> expected = fixed;
-        for (const auto& k : Parse(keys))
-            expected.push_back(k.asString());
-        std::sort(expected.begin(), expected.end());
-        EXPECT_EQ(expected, v.getMemberNames()) << keys;
+        EXPECT_EQ(row.expected, ReadFile(kInfo).value_or(""));
     }
-    EXPECT_EQ(R"({"buildnumber":5644,"debDir":"/volume1/d","newSmallFixNumber":7,)"
-              R"("pkgRestartList":[],"smallupdateDeb":"smallfix_6.1-5644-s7_all.deb",)"
-              R"("updateType":"smallupdate","vyxServiceRestartList":[]})"
-              "\n",
-              ReadFile(kInfo).value_or(""));
 
+    // Everything but the links survives a dump and an import; the flash flag comes back
+    // from the flash package's name.
     SmallUpdate u = Dumpable();
     u.m_blConfigUpdate = u.m_blFlashUpdate = true;
     u.m_flashUpdateDeb = "flash_6.1-5644-s7_all.deb";
@@ -225,9 +168,18 @@ TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
     u.m_pkgRestartList = {"pkgA", "pkgB"};
     ASSERT_TRUE(u.DumpToInfoFile(false));
     SmallUpdate back;
+    back.m_errno = 6;
     ASSERT_TRUE(back.ImportInfoFile(kInfo));
     EXPECT_TRUE(back.Equal(u));
     EXPECT_EQ(5644, back.m_buildNumber);
+    EXPECT_EQ(0, back.GetErrno());
+
+    // Reboot flag only, no installDeb: lists emptied; a flash flag set before is kept.
+    WriteFile(kInfo, R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
+                     R"("debDir":"/d","smallupdateDeb":"s.deb","blNeedReboot":true})");
+    ASSERT_TRUE(back.ImportInfoFile(kInfo));
+    EXPECT_TRUE(back.m_installDebs.empty() && back.m_pkgRestartList.empty());
+    EXPECT_TRUE(back.m_blNeedReboot && back.m_blFlashUpdate && !back.m_blConfigUpdate);
 
     // Passive: stored under debDir, naming the fixed folder; the marker names debDir.
     u.m_debDir = "/volume1/passive";
@@ -243,7 +195,7 @@ TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
 
 TEST_F(SmallUpdateInfoTest, DumpFailuresLeaveNoInfoFiles) {
     struct Row {
-        std::function<void(SmallUpdate&)> change;
+        Change change;
         bool passive;
         std::string log;
     } rows[] = {
@@ -277,15 +229,13 @@ TEST_F(SmallUpdateInfoTest, DownloadProgressAndFolders) {
     EXPECT_EQ((std::map<std::string, std::string>{
                   {"updateType", "smallupdate"}, {"percentage", "42"}, {"downloadStatus", "2"}}),
               ReadKeyValueFile(path));
-    const std::string text = ReadFile(path).value_or("");
-    EXPECT_NE(std::string::npos, text.find("percentage=\"42\"\ndownloadStatus=\"2\"\n"));
     RemoveTree(path);
     Shell("mkdir -p " + path);  // a folder in the way: nothing can be written
     EXPECT_EQ(0, SmallUpdate::UpdateDownloadProgress(0, SmallUpdate::DOWNLOAD_STATUS_STOPPED));
 
-    MountVolume("/volume2", 209715200ULL);  // exactly the 200 MiB a download needs
     SmallUpdate u;
     std::string folder;
+    MountVolume("/volume2", 209715200ULL);  // exactly the 200 MiB a download needs
     ASSERT_TRUE(u.GetSourceDir(folder, "@smallupd@te_deb"));
     EXPECT_EQ("/volume2/@smallupd@te_deb", folder);
 

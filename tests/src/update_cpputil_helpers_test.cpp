@@ -1,0 +1,231 @@
+// UpdateUtil: JSON files and string lists, archives, folders, volumes, the kind of the last
+// download and the user agent.
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <climits>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+#include <kytoplatform/klibc.h>
+#include <kytoplatform/kyto_errors.h>
+
+#include "sandbox.h"
+#include "update_cpputil.h"
+
+namespace {
+
+using kytotest::MountVolume;
+using kytotest::PathExists;
+using kytotest::ReadFile;
+using kytotest::SyslogContains;
+using kytotest::WriteFile;
+using Strings = std::vector<std::string>;
+
+class UpdateUtilTest : public kytotest::SandboxTest {};
+
+TEST_F(UpdateUtilTest, BrokenJsonFilesAreDeletedAndDumpsRewriteInPlace) {
+    const char* path = "/tmp/info.json";
+    Json::Value root;
+    for (const std::string content : {"{", "{\"a\": }"}) {
+        kytotest::ClearSyslog();
+        WriteFile(path, content);
+        EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(path, root), 0);
+        EXPECT_FALSE(PathExists(path)) << content;
+        EXPECT_TRUE(SyslogContains("update_cpputil:", LOG_ERR));
+        EXPECT_TRUE(SyslogContains(" Parse failed", LOG_ERR));
+    }
+    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile("/tmp/absent.json", root), 0);
+    EXPECT_TRUE(SyslogContains(" inFile failed", LOG_ERR));
+
+    KLIBCErrSetEx(0, "", 0);
+    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(nullptr, root), 0);
+    EXPECT_TRUE(SyslogContains(" bad parameters!", LOG_ERR));
+    EXPECT_EQ(UpdateUtil::DumpJsonRootToFile(nullptr, root), 0);
+    EXPECT_TRUE(SyslogContains(" bad parameter!", LOG_ERR));
+    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
+
+    EXPECT_EQ(UpdateUtil::DumpJsonRootToFile("/tmp/null.json", Json::Value()), 1);
+    EXPECT_EQ(ReadFile("/tmp/null.json"), "null\n");
+
+    // Rewritten in place: a second name of the same file sees the new, shorter text.
+    WriteFile(path, std::string(4096, 'x'));
+    ASSERT_EQ(link(path, "/tmp/info.link"), 0);
+    root["updateType"] = "smallupdate";
+    root["list"].append("a");
+    ASSERT_EQ(UpdateUtil::DumpJsonRootToFile(path, root), 1);
+    EXPECT_EQ(ReadFile("/tmp/info.link"), "{\"list\":[\"a\"],\"updateType\":\"smallupdate\"}\n");
+    Json::Value back;
+    ASSERT_EQ(UpdateUtil::ParseJsonRootFromFile(path, back), 1);
+    EXPECT_EQ(back, root);
+
+    WriteFile(path, "[1, 2]");  // any JSON value is a root
+    Json::Value array;
+    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(path, array), 1);
+    EXPECT_EQ(array.size(), 2u);
+
+    EXPECT_EQ(UpdateUtil::DumpJsonRootToFile("/tmp/no/dir/x.json", root), 0);
+    EXPECT_TRUE(SyslogContains(" Failed to open /tmp/no/dir/x.json", LOG_ERR));
+}
+
+TEST_F(UpdateUtilTest, JsonArraysAndStringLists) {
+    auto json = [](const char* text) {
+        Json::Value v;
+        EXPECT_TRUE(Json::Reader().parse(text, v, false)) << text;
+        return v;
+    };
+    // clang-format off
+    struct Case { Json::Value input; int result; Strings out; const char* message; } cases[] = {
+        {json("null"), 0, {}, " bad parameter!"}, {json("{\"k\":\"v\"}"), 0, {}, " bad parameter!"},
+        {json("\"a\""), 0, {}, " bad parameter!"}, {json("[\"a\", 1]"), 0, {}, " not a string"},
+        {json("[]"), 1, {}, nullptr}, {json("[\"b\", \"a\"]"), 1, {"b", "a"}, nullptr}};
+    // clang-format on
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.input.toStyledString());
+        kytotest::ClearSyslog();
+        Strings out = {"stale"};
+        EXPECT_EQ(UpdateUtil::JsonArray2StringVector(c.input, out), c.result);
+        EXPECT_EQ(out, c.out);
+        EXPECT_EQ(SyslogContains(c.message ? c.message : "update_cpputil", LOG_ERR), !!c.message);
+    }
+
+    // Appending accumulates; nothing appended leaves a null value null.
+    Json::Value array;
+    EXPECT_EQ(UpdateUtil::StringVector2JsonArray({}, array), 1);
+    EXPECT_TRUE(array.isNull());
+    UpdateUtil::StringVector2JsonArray({"x", "y"}, array);
+    UpdateUtil::StringVector2JsonArray({"z"}, array);
+    EXPECT_EQ(Json::FastWriter().write(array), "[\"x\",\"y\",\"z\"]\n");
+
+    // Lists compare equal in any order but with the same multiplicities.
+    // clang-format off
+    struct Pair { Strings a, b; int equal; } pairs[] = {
+        {{}, {}, 1}, {{"a", "b", "b"}, {"b", "a", "b"}, 1}, {{"a", "b", "b"}, {"a", "a", "b"}, 0},
+        {{"a", "b"}, {"a", "b", "b"}, 0}, {{"A"}, {"a"}, 0}, {{"a "}, {"a"}, 0},
+        {{"ab", "a"}, {"a", "ab"}, 1}};
+    // clang-format on
+    for (const Pair& c : pairs) {
+        EXPECT_EQ(UpdateUtil::CompareVector(c.a, c.b), c.equal)
+            << testing::PrintToString(c.a) << " vs " << testing::PrintToString(c.b);
+    }
+}
+
+constexpr unsigned long k200MiB = 209715200UL;
+
+mode_t ModeOf(const std::string& path) {
+    struct stat st {};
+    EXPECT_EQ(stat(path.c_str(), &st), 0) << path;
+    return st.st_mode & 07777;
+}
+
+TEST_F(UpdateUtilTest, UntarKeepsPermissionsAndFoldersAreCleaned) {
+    WriteFile("/tmp/src/bin/updater", "#!/bin/sh\n", 0750);
+    WriteFile("/tmp/src/etc/conf", "k=v\n", 0600);
+    ASSERT_EQ(kytotest::Shell("tar cf /tmp/pkg.tar -C /tmp/src bin etc && mkdir /tmp/out"), 0);
+    EXPECT_EQ(UpdateUtil::UntarFile(std::string("/tmp/pkg.tar"), std::string("/tmp/out")), 1);
+    EXPECT_EQ(ReadFile("/tmp/out/bin/updater"), "#!/bin/sh\n");
+    EXPECT_EQ(ModeOf("/tmp/out/bin/updater"), 0750u);
+    EXPECT_EQ(ModeOf("/tmp/out/etc/conf"), 0600u);
+    EXPECT_EQ(UpdateUtil::UntarFile("/tmp/missing.tar", "/tmp/out"), 0);
+    EXPECT_TRUE(SyslogContains(" failed to [tar xpf /tmp/missing.tar -C /tmp/out]", LOG_ERR));
+
+    EXPECT_EQ(UpdateUtil::CleanFolder(std::string("/tmp/out")), 1);
+    EXPECT_TRUE(kytotest::ListDir("/tmp/out").empty());
+    EXPECT_EQ(ModeOf("/tmp/out") & 0755, 0755u);
+    EXPECT_EQ(UpdateUtil::CleanFolder("/tmp/fresh"), 1);  // a missing folder is created
+    EXPECT_TRUE(kytotest::IsDirectory("/tmp/fresh"));
+    EXPECT_EQ(UpdateUtil::RemoveFolder("/tmp/src"), 1);
+    EXPECT_FALSE(PathExists("/tmp/src"));
+
+    EXPECT_EQ(UpdateUtil::CleanFolder("/tmp/noparent/sub"), 0);  // parents are not made
+    EXPECT_FALSE(PathExists("/tmp/noparent"));
+    EXPECT_TRUE(SyslogContains(" Fail to mkdir: /tmp/noparent/sub, KytoErr =[0x0D", LOG_ERR));
+}
+
+TEST_F(UpdateUtilTest, FirstWritableDataVolumeWithEnoughRoomWinsElseRoot) {
+    std::string path = "unchanged";
+    EXPECT_EQ(UpdateUtil::IsThereAvailVolPath(path, 1, false), 0);  // no volume: no message
+    EXPECT_FALSE(SyslogContains("update_cpputil"));
+    EXPECT_EQ(UpdateUtil::IsThereAvailVolPath(path, ULONG_MAX, true), 0);
+    EXPECT_EQ(path, "unchanged");
+    EXPECT_TRUE(SyslogContains(" sad.. / do not have sufficient size.", LOG_ERR));
+    EXPECT_EQ(UpdateUtil::IsThereAvailVolPath(path, 1, true), 1);
+    EXPECT_EQ(path, "/");
+    EXPECT_TRUE(SyslogContains(" We get / to upgrade.", LOG_INFO));
+
+    MountVolume("/volumeUSB1", 2 * k200MiB);  // not a data volume
+    MountVolume("/volume1", 2 * k200MiB, /*readOnly=*/true);
+    MountVolume("/volume2", k200MiB);
+    MountVolume("/volume3", 2 * k200MiB);
+    EXPECT_EQ(UpdateUtil::IsThereAvailVolPath(path, k200MiB, false), 1);  // exactly enough
+    EXPECT_EQ(path, "/volume2");
+    EXPECT_TRUE(SyslogContains(" sad.. /volume1 is not a writable volume.", LOG_ERR));
+    EXPECT_TRUE(SyslogContains(" We get /volume2 to upgrade.", LOG_INFO));
+
+    kytotest::ClearSyslog();
+    EXPECT_EQ(UpdateUtil::IsThereAvailVolPath(path, k200MiB + 1, false), 1);
+    EXPECT_EQ(path, "/volume3");
+    EXPECT_TRUE(SyslogContains(" 209715200 < 209715201, check next volume.", LOG_ERR));
+    EXPECT_FALSE(SyslogContains("volumeUSB1"));
+
+    EXPECT_EQ(UpdateUtil::IsThereAvailVolPath(path, 2 * k200MiB + 1, false), 0);
+    EXPECT_EQ(path, "/volume3");
+}
+
+TEST_F(UpdateUtilTest, DownloadedPatchTypeFromInfoFile) {
+    const char* info = "/autoupd@te.info";
+    const auto kNone = UpdateUtil::PATCH_TYPE_NONE, kSmall = UpdateUtil::PATCH_TYPE_SMALL,
+               kVyx = UpdateUtil::PATCH_TYPE_VYX;
+    const char* kNoMember = " Unrecognized download info, no [updateType]";
+    // clang-format off
+    struct Case { const char* content; UpdateUtil::PATCH_TYPE type; const char* infoMessage; }
+    cases[] = {  // content nullptr: no file
+        {nullptr, kNone, nullptr}, {"{\"updateType\":\"vyxupdate\"}", kVyx, nullptr},
+        {"{\"updateType\":\"smallupdate\"}", kSmall, nullptr},
+        {"{\"updateType\":\"vyxupdate \"}", kSmall, nullptr}, {"{}", kNone, nullptr},
+        {"{\"patchPath\":\"/x\"}", kNone, kNoMember}, {"[1]", kNone, kNoMember},
+        {"{\"updateType\":", kNone, " [/autoupd@te.info] does not contain correct format"}};
+    // clang-format on
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.content ? c.content : "(no file)");
+        kytotest::ClearSyslog();
+        kytotest::RemoveTree(info);
+        if (c.content)
+            WriteFile(info, c.content);
+        UpdateUtil::PATCH_TYPE type = UpdateUtil::PATCH_TYPE_SMALL;
+        UpdateUtil::CheckDownloadedPatchType(type);
+        EXPECT_EQ(type, c.type);
+        const char* message = c.infoMessage ? c.infoMessage : "update_cpputil";
+        EXPECT_EQ(SyslogContains(message, LOG_INFO), c.infoMessage != nullptr);
+    }
+    EXPECT_FALSE(PathExists(info));  // the broken one was deleted
+}
+
+TEST_F(UpdateUtilTest, UserAgentFromTheVersionFiles) {
+    std::string agent;
+    ASSERT_EQ(UpdateUtil::GetUserAgent(agent), 1);
+    EXPECT_EQ(agent, "demo_model VYX5.2 5644 (autoupgrade)");
+
+    // A missing key is an empty field; values are cut to their buffers.
+    kytotest::SetKeyValue("/etc.defaults/VERSION", "minorversion", std::nullopt);
+    kytotest::SetKeyValue("/etc.defaults/VERSION", "majorversion", std::string(20, '7'));
+    kytotest::SetKeyValue("/etc.defaults/kytoinfo.conf", "unique", std::string(200, 'u'));
+    ASSERT_EQ(UpdateUtil::GetUserAgent(agent), 1);
+    EXPECT_EQ(agent,
+              std::string(127, 'u') + " VYX" + std::string(15, '7') + ". 5644 (autoupgrade)");
+
+    // Unreadable files fail and leave the agent alone.
+    agent = "unchanged";
+    kytotest::RemoveTree("/etc.defaults/VERSION");
+    ASSERT_EQ(mkdir("/etc.defaults/VERSION", 0755), 0);
+    EXPECT_EQ(UpdateUtil::GetUserAgent(agent), 0);
+    EXPECT_TRUE(SyslogContains(" Get buildnumber Fail[0x0D03 ", LOG_ERR));
+    kytotest::RemoveTree("/etc.defaults/kytoinfo.conf");
+    EXPECT_EQ(UpdateUtil::GetUserAgent(agent), 0);
+    EXPECT_TRUE(SyslogContains(" Get unique Fail[0x0D02 ", LOG_ERR));
+    EXPECT_EQ(agent, "unchanged");
+}
+
+}  // namespace
