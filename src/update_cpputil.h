@@ -10,7 +10,7 @@
 #include <json/json.h>
 
 class UpdateUtil {
-public:
+  public:
     // Kind of a downloaded update; the facade numbers its update type the same way.
     enum PATCH_TYPE {
         PATCH_TYPE_NONE = 0,   // no usable download info

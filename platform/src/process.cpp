@@ -48,6 +48,15 @@ int PidFromFile(const char* pidFile) {
     return pid > 0 ? pid : -1;  // KLIBCReadPidFile set the error
 }
 
+// Waits for a child just spawned.  A program that could not be executed still yields its
+// exit status 127, but the last error tells that exec failed.
+int WaitReporting(pid_t pid, bool execFailed) {
+    int status = kytoplat::WaitProgram(pid);
+    if (execFailed)
+        KYTO_FAIL(KYTO_ERR_EXEC);
+    return status;
+}
+
 }  // namespace
 
 namespace kytoplat {
@@ -129,7 +138,7 @@ int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, 
     bool execFailed;
     if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0)
         return -1;
-    return kytoplat::WaitProgram(pid);
+    return WaitReporting(pid, execFailed);
 }
 
 int KLIBCExecv(const char* prog, char* const argv[], int blWait) {
@@ -143,7 +152,7 @@ int KLIBCExecv(const char* prog, char* const argv[], int blWait) {
         return -1;
     if (!blWait)
         return pid;
-    return kytoplat::WaitProgram(pid);
+    return WaitReporting(pid, execFailed);
 }
 
 int KLIBCReadPidFile(const char* path) {

@@ -44,8 +44,9 @@ PKLIBC_SZLIST KLIBCSzListAlloc(int capacity) {
 }
 
 int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) {
+    // A capacity below 1 never comes from KLIBCSzListAlloc and could not be doubled.
     if (text == nullptr || delims == nullptr || list == nullptr || *list == nullptr ||
-        (*list)->nItem < 0 || (*list)->nItem > (*list)->nAlloc) {
+        (*list)->nAlloc < 1 || (*list)->nItem < 0 || (*list)->nItem > (*list)->nAlloc) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }

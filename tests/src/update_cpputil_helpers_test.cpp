@@ -28,22 +28,22 @@ class UpdateUtilTest : public kytotest::SandboxTest {};
 
 TEST_F(UpdateUtilTest, BrokenJsonFilesAreDeletedAndDumpsRewriteInPlace) {
     const char* path = "/tmp/info.json";
-    Json::Value root;
+    Json::Value scratch;  // a failed parse may leave partial content
     for (const std::string content : {"{", "{\"a\": }"}) {
         kytotest::ClearSyslog();
         WriteFile(path, content);
-        EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(path, root), 0);
+        EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(path, scratch), 0);
         EXPECT_FALSE(PathExists(path)) << content;
         EXPECT_TRUE(SyslogContains("update_cpputil:", LOG_ERR));
         EXPECT_TRUE(SyslogContains(" Parse failed", LOG_ERR));
     }
-    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile("/tmp/absent.json", root), 0);
+    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile("/tmp/absent.json", scratch), 0);
     EXPECT_TRUE(SyslogContains(" inFile failed", LOG_ERR));
 
     KLIBCErrSetEx(0, "", 0);
-    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(nullptr, root), 0);
+    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile(nullptr, scratch), 0);
     EXPECT_TRUE(SyslogContains(" bad parameters!", LOG_ERR));
-    EXPECT_EQ(UpdateUtil::DumpJsonRootToFile(nullptr, root), 0);
+    EXPECT_EQ(UpdateUtil::DumpJsonRootToFile(nullptr, scratch), 0);
     EXPECT_TRUE(SyslogContains(" bad parameter!", LOG_ERR));
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
 
@@ -53,6 +53,7 @@ TEST_F(UpdateUtilTest, BrokenJsonFilesAreDeletedAndDumpsRewriteInPlace) {
     // Rewritten in place: a second name of the same file sees the new, shorter text.
     WriteFile(path, std::string(4096, 'x'));
     ASSERT_EQ(link(path, "/tmp/info.link"), 0);
+    Json::Value root;
     root["updateType"] = "smallupdate";
     root["list"].append("a");
     ASSERT_EQ(UpdateUtil::DumpJsonRootToFile(path, root), 1);

@@ -72,7 +72,7 @@ int KLIBCFileExist(const char* path);
  * cleared; other descriptors are inherited as they are (every descriptor of this library
  * is close-on-exec).  Returns the exit status 0..255; -1 when it cannot fork or wait, or
  * the child died by a signal (KYTO_ERR_EXEC).  A program that cannot be executed exits
- * with 127. */
+ * with 127, and the last error is then KYTO_ERR_EXEC. */
 int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4);
 /* The same with a NULL-terminated argv (argv[0] included).  With blWait 0 the child's pid
  * is returned without waiting (the caller reaps it). */
@@ -93,9 +93,9 @@ int KLIBCKill(const char* pidFile, int blForce);
 /* A growable list of C strings, allocated as one object (header and pointer array); each
  * item is a separately allocated copy owned by the list. */
 typedef struct _tag_KLIBC_SZLIST {
-    int nItem;         /* items in use */
-    int nAlloc;        /* capacity of pszItem */
-    char* pszItem[1];  /* nAlloc entries */
+    int nItem;        /* items in use */
+    int nAlloc;       /* capacity of pszItem */
+    char* pszItem[1]; /* nAlloc entries */
 } KLIBC_SZLIST, *PKLIBC_SZLIST;
 
 /* NULL on bad size (< 1) or no memory. */

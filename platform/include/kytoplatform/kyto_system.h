@@ -28,8 +28,8 @@ int KYTOLogSet1(int category, int level, unsigned int eventCode, const char* s1,
 /* One mounted data volume: a file system mounted at "/volume" followed by digits only. */
 typedef struct _tag_KYTO_MOUNT_VOL_INFO {
     char szMountPath[KYTO_VOL_PATH_MAX];
-    int blWritable;                       /* mounted read-write and not ST_RDONLY */
-    unsigned long long ullFreeBytes;      /* f_bavail * f_frsize */
+    int blWritable;                  /* mounted read-write and not ST_RDONLY */
+    unsigned long long ullFreeBytes; /* f_bavail * f_frsize */
     struct _tag_KYTO_MOUNT_VOL_INFO* pNext;
 } KYTO_MOUNT_VOL_INFO, *PKYTO_MOUNT_VOL_INFO;
 

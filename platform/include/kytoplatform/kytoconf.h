@@ -8,7 +8,7 @@
 #include <string>
 
 class KytoConf {
-public:
+  public:
     static constexpr const char* kDefaultsPath = "/etc.defaults/kytoinfo.conf";
     static constexpr const char* kInfoPath = "/etc/kytoinfo.conf";
 
