@@ -14,6 +14,7 @@
 #include <kytoplatform/klibc.h>
 
 #include "kyto_paths.h"
+#include "scoped.h"
 
 namespace {
 
@@ -77,11 +78,7 @@ bool DebianLib::ExecDpkg(const std::string& option, const std::string& package,
     }
 
     int status = 0;
-    pid_t waited;
-    do {
-        waited = waitpid(pid, &status, 0);
-    } while (waited < 0 && errno == EINTR);
-    if (waited < 0) {
+    if (kyto::WaitForChild(pid, &status) < 0) {
         syslog(LOG_ERR, "%s:%d Fail to exec [dpkg %s %s] error=[%m]", kModule, __LINE__,
                option.c_str(), package.c_str());
         return false;

@@ -3,7 +3,10 @@
 #ifndef KYTOINSTALLCPP_SCOPED_H
 #define KYTOINSTALLCPP_SCOPED_H
 
+#include <errno.h>
 #include <stdio.h>
+#include <sys/types.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <string>
@@ -13,13 +16,14 @@ namespace kyto {
 
 // Owns a file descriptor.
 class UniqueFd {
-public:
+  public:
     UniqueFd() = default;
     explicit UniqueFd(int fd) : fd_(fd) {}
     ~UniqueFd() { reset(); }
     UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
     UniqueFd& operator=(UniqueFd&& o) noexcept {
-        if (this != &o) reset(o.release());
+        if (this != &o)
+            reset(o.release());
         return *this;
     }
     UniqueFd(const UniqueFd&) = delete;
@@ -29,17 +33,18 @@ public:
     bool valid() const { return fd_ >= 0; }
     int release() { return std::exchange(fd_, -1); }
     void reset(int fd = -1) {
-        if (fd_ >= 0) ::close(fd_);
+        if (fd_ >= 0)
+            ::close(fd_);
         fd_ = fd;
     }
 
-private:
+  private:
     int fd_ = -1;
 };
 
 // Owns a FILE* opened with fopen (closed with fclose) or popen (closed with pclose).
 class UniqueFile {
-public:
+  public:
     enum Kind { kFopen, kPopen };
     UniqueFile() = default;
     explicit UniqueFile(FILE* f, Kind kind = kFopen) : f_(f), kind_(kind) {}
@@ -51,31 +56,43 @@ public:
     explicit operator bool() const { return f_ != nullptr; }
     // Closes now; returns fclose's or pclose's result (-1 when nothing was open).
     int close() {
-        if (!f_) return -1;
+        if (!f_)
+            return -1;
         FILE* f = std::exchange(f_, nullptr);
         return kind_ == kPopen ? ::pclose(f) : ::fclose(f);
     }
 
-private:
+  private:
     FILE* f_ = nullptr;
     Kind kind_ = kFopen;
 };
 
 // Unlinks a path when it goes out of scope, unless released.
 class ScopedUnlink {
-public:
+  public:
     explicit ScopedUnlink(std::string path) : path_(std::move(path)) {}
     ~ScopedUnlink() {
-        if (!path_.empty()) ::unlink(path_.c_str());
+        if (!path_.empty())
+            ::unlink(path_.c_str());
     }
     ScopedUnlink(const ScopedUnlink&) = delete;
     ScopedUnlink& operator=(const ScopedUnlink&) = delete;
     void release() { path_.clear(); }
     const std::string& path() const { return path_; }
 
-private:
+  private:
     std::string path_;
 };
+
+// Waits for one child, retrying when a signal interrupts the wait.  Returns waitpid's
+// result (the pid, or -1 with errno set).
+inline pid_t WaitForChild(pid_t pid, int* status) {
+    pid_t r;
+    do {
+        r = ::waitpid(pid, status, 0);
+    } while (r < 0 && errno == EINTR);
+    return r;
+}
 
 }  // namespace kyto
 

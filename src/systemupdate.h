@@ -10,7 +10,7 @@
 #include "vyxupdate.h"
 
 class SystemUpdate {
-public:
+  public:
     SystemUpdate();
 
     SmallUpdate m_smallUpdate;

@@ -818,11 +818,7 @@ bool VyxUpdate::ExecWgetP(std::string outputPath, std::string url, bool& cancell
     }
 
     int status = 0;
-    pid_t waited;
-    do {
-        waited = waitpid(pid, &status, 0);
-    } while (waited < 0 && errno == EINTR);
-    if (waited < 0) {
+    if (kyto::WaitForChild(pid, &status) < 0) {
         syslog(LOG_ERR, "%s:%d Fail to download VYX patch [%m]", kModule, __LINE__);
         KLIBCExec("/bin/rm", "-f", outputPath.c_str(), nullptr, nullptr);
         return false;

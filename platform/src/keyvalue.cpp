@@ -69,20 +69,26 @@ void SplitPath(const std::string& path, std::string* dir, std::string* base) {
 
 namespace kytoplat {
 
-int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewline) {
-    lines->clear();
-    *endsWithNewline = true;
+UniqueFd OpenFileForReading(const char* path) {
     UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
     if (!fd.valid()) {
-        KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                      : KYTO_ERR_FILE_OPEN);
-        return -1;
+        KYTO_FAIL(OpenErrorCode(errno, KYTO_ERR_FILE_OPEN));
+        return fd;
     }
     struct stat st;
     if (::fstat(fd.get(), &st) != 0 || S_ISDIR(st.st_mode)) {
         KYTO_FAIL(KYTO_ERR_FILE_OPEN);
-        return -1;
+        fd.reset();
     }
+    return fd;
+}
+
+int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewline) {
+    lines->clear();
+    *endsWithNewline = true;
+    UniqueFd fd = OpenFileForReading(path);
+    if (!fd.valid())
+        return -1;
     // Read in chunks and split at newlines; memory stays bounded by the line limit even
     // when a file holds one endless line.
     std::string cur;
@@ -257,8 +263,7 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
     std::string tmpl = dir + "/." + base + ".XXXXXX";
     kytoplat::UniqueFd fd(::mkostemp(&tmpl[0], O_CLOEXEC));
     if (!fd.valid()) {
-        KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                      : KYTO_ERR_FILE_WRITE);
+        KYTO_FAIL(kytoplat::OpenErrorCode(errno, KYTO_ERR_FILE_WRITE));
         return -1;
     }
     kytoplat::ScopedUnlink cleanup(tmpl);

@@ -3,6 +3,7 @@
 #ifndef KYTOPLATFORM_PLATFORM_INTERNAL_H
 #define KYTOPLATFORM_PLATFORM_INTERNAL_H
 
+#include <errno.h>
 #include <stdio.h>
 #include <unistd.h>
 
@@ -26,6 +27,12 @@ class UniqueFd {
     UniqueFd() = default;
     explicit UniqueFd(int fd) : fd_(fd) {}
     ~UniqueFd() { reset(); }
+    UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
+    UniqueFd& operator=(UniqueFd&& o) noexcept {
+        if (this != &o)
+            reset(o.release());
+        return *this;
+    }
     UniqueFd(const UniqueFd&) = delete;
     UniqueFd& operator=(const UniqueFd&) = delete;
 
@@ -93,6 +100,17 @@ class ErrorKeeper {
     int line_;
     std::string file_;
 };
+
+// Error code for a failed open/opendir/mkstemp: a missing path (or a missing folder on
+// the way) is KYTO_ERR_FILE_NOT_FOUND, anything else `otherwise`.
+inline int OpenErrorCode(int err, int otherwise) {
+    return err == ENOENT || err == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND : otherwise;
+}
+
+// Opens an existing file that is not a folder for reading (O_CLOEXEC).  Returns an
+// invalid descriptor with the last error set (KYTO_ERR_FILE_NOT_FOUND or
+// KYTO_ERR_FILE_OPEN) on failure.
+UniqueFd OpenFileForReading(const char* path);
 
 // ---- key=value files ------------------------------------------------------------------
 

@@ -160,17 +160,9 @@ int KLIBCReadPidFile(const char* path) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
-    kytoplat::UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
-    if (!fd.valid()) {
-        KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                      : KYTO_ERR_FILE_OPEN);
+    kytoplat::UniqueFd fd = kytoplat::OpenFileForReading(path);
+    if (!fd.valid())
         return -1;
-    }
-    struct stat st;
-    if (::fstat(fd.get(), &st) != 0 || S_ISDIR(st.st_mode)) {
-        KYTO_FAIL(KYTO_ERR_FILE_OPEN);
-        return -1;
-    }
     std::string text;
     char buf[kPidFileMax + 1];
     while (text.size() <= kPidFileMax) {

@@ -52,8 +52,7 @@ int KYTOServiceOnOffALL(int action) {
     }
     std::unique_ptr<DIR, DirCloser> dir(opendir(kRcDir));
     if (!dir) {
-        KYTO_FAIL(errno == ENOENT || errno == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND
-                                                      : KYTO_ERR_FILE_OPEN);
+        KYTO_FAIL(kytoplat::OpenErrorCode(errno, KYTO_ERR_FILE_OPEN));
         return -1;
     }
     std::vector<std::string> scripts;
