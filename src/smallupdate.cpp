@@ -60,18 +60,18 @@ const char* const kStageWords[] = {
     "none", "waiting_remote_upgrading", "analying", "program", "startService", "finished", "reboot",
 };
 
-// Reads an optional string member: only a JSON string counts, anything else (a missing
-// key included) reads as "".
+// Reads an optional string member with jsoncpp's own conversion (a missing key reads as
+// "", a number as its text); a container, which jsoncpp cannot convert, reads as "".
 std::string OptionalString(const Json::Value& root, const char* key) {
     const Json::Value& v = root[key];
-    return v.isString() ? v.asString() : std::string();
+    return v.isConvertibleTo(Json::stringValue) ? v.asString() : std::string();
 }
 
-// Reads an optional boolean member: only a JSON boolean counts, anything else (a missing
-// key included) reads as false.
+// Reads an optional boolean member with jsoncpp's own conversion (a missing key reads as
+// false, a non-zero number as true); a value jsoncpp cannot convert reads as false.
 bool OptionalBool(const Json::Value& root, const char* key) {
     const Json::Value& v = root[key];
-    return v.isBool() && v.asBool();
+    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
 }
 
 // Converts an optional array of strings; a missing key is an empty list.

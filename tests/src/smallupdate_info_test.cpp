@@ -193,6 +193,26 @@ TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
               ReadKeyValueFile(kPassive));
 }
 
+// Optional members follow jsoncpp's conversions (a number reads as a boolean); values it
+// cannot convert read as the default instead of throwing.
+TEST_F(SmallUpdateInfoTest, ImportConvertsOptionalMembersLikeJsoncpp) {
+    Json::Value v = Parse(kValidInfo);
+    v["configUpdate"] = 1;
+    v["blNeedReboot"] = 1;
+    v["installDeb"] = Json::Value(Json::arrayValue);
+    WriteFile(kInfo, Json::FastWriter().write(v));
+    SmallUpdate u;
+    ASSERT_TRUE(u.ImportInfoFile(kInfo));
+    EXPECT_TRUE(u.m_blConfigUpdate && u.m_blNeedReboot);
+
+    v["configUpdate"] = "yes";
+    v["smallupdateDeb"] = Json::Value(Json::arrayValue);
+    WriteFile(kInfo, Json::FastWriter().write(v));
+    EXPECT_NO_THROW(EXPECT_TRUE(u.ImportInfoFile(kInfo)));
+    EXPECT_FALSE(u.m_blConfigUpdate);
+    EXPECT_EQ("", u.m_smallUpdateDeb);
+}
+
 TEST_F(SmallUpdateInfoTest, DumpFailuresLeaveNoInfoFiles) {
     struct Row {
         Change change;
