@@ -108,6 +108,10 @@ int UpdateUtil::JsonArray2StringVector(const Json::Value& array, std::vector<std
 }
 
 int UpdateUtil::StringVector2JsonArray(const std::vector<std::string>& in, Json::Value& array) {
+    // Appending to a value that is neither null nor an array would throw inside the JSON
+    // library; such a value is left as it is.
+    if (!array.isNull() && !array.isArray())
+        return 1;
     for (const std::string& s : in)
         array.append(Json::Value(s));
     return 1;

@@ -21,7 +21,7 @@ Json::Value J(const std::string& text) {
 }
 
 std::string Deb(const std::string& package, int fix) {
-    return DebFileName(MakeDebSpec(package, SmallFixVersion("6.1", 5644, fix)));
+    return DebFileName(MakeDebPackage(package, SmallFixVersion("6.1", 5644, fix)));
 }
 
 // {"name": name, "url": base + the package file of `package` in fix `fix`}

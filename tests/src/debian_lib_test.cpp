@@ -48,9 +48,9 @@ TEST_F(DebianLibTest, RunsDpkgWithBannersAndOutputInTheLog) {
     WriteFile("/tmp/order.log", "");
     const std::string ok =
         BuildDeb(OrderLoggingDeb("kytotest-dl-install", "1.0", "/tmp/order.log"), kDebDir);
-    DebSpec spec = MakeDebSpec("kytotest-dl-extract", "2.0-5644-s1");
-    spec.files["/updater"] = "#!/bin/sh\nexit 0\n";
-    const std::string extract = BuildDeb(spec, kDebDir);
+    DebPackage pkg = MakeDebPackage("kytotest-dl-extract", "2.0-5644-s1");
+    pkg.files["/updater"] = "#!/bin/sh\nexit 0\n";
+    const std::string extract = BuildDeb(pkg, kDebDir);
     const std::string bad = BuildDeb(FailingDeb("kytotest-dl-fail", "1.0"), kDebDir);
 
     EXPECT_TRUE(DebianLib::ExecDpkg("-x", extract, "/tmp/unpacked"));
@@ -80,9 +80,9 @@ TEST_F(DebianLibTest, RunsDpkgWithBannersAndOutputInTheLog) {
 
 TEST_F(DebianLibTest, DpkgKilledBySignalCountsAsSuccess) {
     // dpkg runs the preinst directly, so the script's parent is dpkg itself.
-    DebSpec spec = MakeDebSpec("kytotest-dl-killed", "1.0");
-    spec.preinst = "#!/bin/sh\nkill -9 $PPID\nexit 0\n";
-    EXPECT_TRUE(DebianLib::ExecDpkg("-i", BuildDeb(spec, kDebDir)));
+    DebPackage pkg = MakeDebPackage("kytotest-dl-killed", "1.0");
+    pkg.preinst = "#!/bin/sh\nkill -9 $PPID\nexit 0\n";
+    EXPECT_TRUE(DebianLib::ExecDpkg("-i", BuildDeb(pkg, kDebDir)));
     EXPECT_FALSE(IsInstalled("kytotest-dl-killed"));
     EXPECT_EQ(ReadFile(kDpkgLog)->find("Failed to install"), std::string::npos);
 }

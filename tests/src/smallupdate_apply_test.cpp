@@ -40,16 +40,15 @@ std::vector<std::string> Lines(const std::string& path, const std::string& onlyW
 // package); a failing one exits 1 instead; `updater` ships a script at `updaterPath`.
 std::string Deb(const std::string& name, int fix, bool fails = false,
                 const std::string& updaterPath = "", const std::string& updater = "") {
-    DebSpec spec = fails ? FailingDeb(name, SmallFixVersion("6.1", 5644, fix))
-                         : MakeDebSpec(name, SmallFixVersion("6.1", 5644, fix));
+    DebPackage pkg = fails ? FailingDeb(name, SmallFixVersion("6.1", 5644, fix))
+                           : MakeDebPackage(name, SmallFixVersion("6.1", 5644, fix));
     if (!fails && updaterPath.empty()) {
-        spec.postinst = "#!/bin/sh\necho " + name +
-                        " $(sed -n 's/^percentage=\"\\(.*\\)\"/\\1/p' " + kApplyStatus + ") >> " +
-                        kOrderLog + "\n";
+        pkg.postinst = "#!/bin/sh\necho " + name + " $(sed -n 's/^percentage=\"\\(.*\\)\"/\\1/p' " +
+                       kApplyStatus + ") >> " + kOrderLog + "\n";
     }
     if (!updaterPath.empty())
-        spec.files[updaterPath] = updater;
-    const std::string path = BuildDeb(spec, kDebDir);
+        pkg.files[updaterPath] = updater;
+    const std::string path = BuildDeb(pkg, kDebDir);
     return path.substr(path.rfind('/') + 1);
 }
 
@@ -270,10 +269,10 @@ TEST_F(SmallUpdateApplyTest, FlashRunsTheUpdaterInsideItsFolder) {
 }
 
 TEST_F(SmallUpdateApplyTest, UnpackStagesPayloadsAndConfigUpdateRuns) {
-    DebSpec spec = MakeDebSpec("smallfix", SmallFixVersion("6.1", 5644, 6));
-    spec.files["/configupdate"] = "#!/bin/sh\necho \"$@\" > /tmp/configupdate.args\nexit 0\n";
-    spec.files["/smallupd@ter/boot.sh"] = "#!/bin/sh\nexit 0\n";
-    const std::string path = BuildDeb(spec, kDebDir);
+    DebPackage pkg = MakeDebPackage("smallfix", SmallFixVersion("6.1", 5644, 6));
+    pkg.files["/configupdate"] = "#!/bin/sh\necho \"$@\" > /tmp/configupdate.args\nexit 0\n";
+    pkg.files["/smallupd@ter/boot.sh"] = "#!/bin/sh\nexit 0\n";
+    const std::string path = BuildDeb(pkg, kDebDir);
     u.m_smallUpdateDeb = path.substr(path.rfind('/') + 1);
 
     struct Row {

@@ -114,8 +114,8 @@ class VyxServerTest : public kytotest::SandboxTest {
         // the transfer is really under way.
         EXPECT_TRUE(WaitFor([] {
             struct stat st;
-            return KLIBCReadPidFile(kPid) > 0 &&
-                   stat((kFolder + "/slow.img").c_str(), &st) == 0 && st.st_size > 0;
+            return KLIBCReadPidFile(kPid) > 0 && stat((kFolder + "/slow.img").c_str(), &st) == 0 &&
+                   st.st_size > 0;
         }));
         return pid;
     }

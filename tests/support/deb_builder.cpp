@@ -77,24 +77,24 @@ int RunCommand(const std::string& command, std::string* output) {
 
 }  // namespace
 
-DebSpec MakeDebSpec(const std::string& package, const std::string& version,
-                    const std::string& arch) {
-    DebSpec spec;
-    spec.package = package;
-    spec.version = version;
-    spec.arch = arch;
-    return spec;
+DebPackage MakeDebPackage(const std::string& package, const std::string& version,
+                          const std::string& arch) {
+    DebPackage pkg;
+    pkg.package = package;
+    pkg.version = version;
+    pkg.arch = arch;
+    return pkg;
 }
 
-std::string DebFileName(const DebSpec& spec) {
-    return spec.package + "_" + spec.version + "_" + spec.arch + ".deb";
+std::string DebFileName(const DebPackage& pkg) {
+    return pkg.package + "_" + pkg.version + "_" + pkg.arch + ".deb";
 }
 
 std::string SmallFixVersion(const std::string& base, int build, int fix) {
     return base + "-" + std::to_string(build) + "-s" + std::to_string(fix);
 }
 
-std::string BuildDeb(const DebSpec& spec, const std::string& outDir) {
+std::string BuildDeb(const DebPackage& pkg, const std::string& outDir) {
     if (!MakeDirs(outDir)) {
         ADD_FAILURE() << "cannot create " << outDir << ": " << strerror(errno);
         return "";
@@ -109,23 +109,23 @@ std::string BuildDeb(const DebSpec& spec, const std::string& outDir) {
     chmod(stage.c_str(), 0755);
 
     bool ok = MakeDirs(stage + "/DEBIAN");
-    std::string control = "Package: " + spec.package + "\nVersion: " + spec.version +
-                          "\nArchitecture: " + spec.arch +
+    std::string control = "Package: " + pkg.package + "\nVersion: " + pkg.version +
+                          "\nArchitecture: " + pkg.arch +
                           "\nMaintainer: Test Builder <tests@example.invalid>\n"
                           "Section: misc\nPriority: optional\n"
                           "Description: test package " +
-                          spec.package + "\n";
+                          pkg.package + "\n";
     ok = ok && WriteWithMode(stage + "/DEBIAN/control", control, 0644);
-    const std::pair<const char*, const std::string*> scripts[] = {{"preinst", &spec.preinst},
-                                                                  {"postinst", &spec.postinst},
-                                                                  {"prerm", &spec.prerm},
-                                                                  {"postrm", &spec.postrm}};
+    const std::pair<const char*, const std::string*> scripts[] = {{"preinst", &pkg.preinst},
+                                                                  {"postinst", &pkg.postinst},
+                                                                  {"prerm", &pkg.prerm},
+                                                                  {"postrm", &pkg.postrm}};
     for (const auto& script : scripts) {
         if (script.second->empty())
             continue;
         ok = ok && WriteWithMode(stage + "/DEBIAN/" + script.first, *script.second, 0755);
     }
-    for (const auto& file : spec.files) {
+    for (const auto& file : pkg.files) {
         mode_t mode = file.second.compare(0, 2, "#!") == 0 ? 0755 : 0644;
         std::string rel = file.first;
         if (rel.empty() || rel[0] != '/')
@@ -133,7 +133,7 @@ std::string BuildDeb(const DebSpec& spec, const std::string& outDir) {
         ok = ok && WriteWithMode(stage + rel, file.second, mode);
     }
 
-    const std::string target = outDir + "/" + DebFileName(spec);
+    const std::string target = outDir + "/" + DebFileName(pkg);
     std::string output;
     int rc = -1;
     if (ok) {
@@ -144,30 +144,30 @@ std::string BuildDeb(const DebSpec& spec, const std::string& outDir) {
     std::string ignored;
     RunCommand("rm -rf " + ShellQuote(stage), &ignored);
     if (!ok) {
-        ADD_FAILURE() << "cannot stage package " << spec.package;
+        ADD_FAILURE() << "cannot stage package " << pkg.package;
         return "";
     }
     if (rc != 0) {
-        ADD_FAILURE() << "dpkg-deb failed (" << rc << ") for " << spec.package << ": " << output;
+        ADD_FAILURE() << "dpkg-deb failed (" << rc << ") for " << pkg.package << ": " << output;
         return "";
     }
     return target;
 }
 
-DebSpec OrderLoggingDeb(const std::string& package, const std::string& version,
-                        const std::string& orderLog) {
-    DebSpec spec = MakeDebSpec(package, version);
-    spec.files["/usr/share/kytotest/" + package + ".txt"] = package + "\n";
-    spec.postinst = "#!/bin/sh\nset -e\nif [ \"$1\" = configure ]; then\n    echo " +
-                    ShellQuote(package) + " >> " + ShellQuote(orderLog) + "\nfi\nexit 0\n";
-    return spec;
+DebPackage OrderLoggingDeb(const std::string& package, const std::string& version,
+                           const std::string& orderLog) {
+    DebPackage pkg = MakeDebPackage(package, version);
+    pkg.files["/usr/share/kytotest/" + package + ".txt"] = package + "\n";
+    pkg.postinst = "#!/bin/sh\nset -e\nif [ \"$1\" = configure ]; then\n    echo " +
+                   ShellQuote(package) + " >> " + ShellQuote(orderLog) + "\nfi\nexit 0\n";
+    return pkg;
 }
 
-DebSpec FailingDeb(const std::string& package, const std::string& version) {
-    DebSpec spec = MakeDebSpec(package, version);
-    spec.files["/usr/share/kytotest/" + package + ".txt"] = package + "\n";
-    spec.postinst = "#!/bin/sh\necho 'postinst of " + package + " fails on purpose' >&2\nexit 1\n";
-    return spec;
+DebPackage FailingDeb(const std::string& package, const std::string& version) {
+    DebPackage pkg = MakeDebPackage(package, version);
+    pkg.files["/usr/share/kytotest/" + package + ".txt"] = package + "\n";
+    pkg.postinst = "#!/bin/sh\necho 'postinst of " + package + " fails on purpose' >&2\nexit 1\n";
+    return pkg;
 }
 
 }  // namespace kytotest

@@ -14,7 +14,7 @@
 namespace kytotest {
 
 // Description of one package to build.
-struct DebSpec {
+struct DebPackage {
     // Package name (lower case, digits, '+', '-', '.'; no '_').
     std::string package;
     // Version, e.g. SmallFixVersion("6.1", 5644, 3) == "6.1-5644-s3".
@@ -30,18 +30,18 @@ struct DebSpec {
     std::string preinst, postinst, prerm, postrm;
 };
 
-// A spec with only name, version and architecture set (brace-initialising DebSpec with
+// A package with only name, version and architecture set (brace-initialising DebPackage with
 // fewer fields trips -Wmissing-field-initializers).
-DebSpec MakeDebSpec(const std::string& package, const std::string& version,
-                    const std::string& arch = "all");
+DebPackage MakeDebPackage(const std::string& package, const std::string& version,
+                          const std::string& arch = "all");
 
-// "package_version_arch.deb" for spec.
-std::string DebFileName(const DebSpec& spec);
+// "package_version_arch.deb" for pkg.
+std::string DebFileName(const DebPackage& pkg);
 
-// Builds spec into outDir (created if missing) and returns outDir + "/" + DebFileName(spec).
+// Builds pkg into outDir (created if missing) and returns outDir + "/" + DebFileName(pkg).
 // The staging tree is made in a temporary folder under outDir and removed afterwards.
 // Fails the current test (GoogleTest ADD_FAILURE) and returns "" when dpkg-deb fails.
-std::string BuildDeb(const DebSpec& spec, const std::string& outDir);
+std::string BuildDeb(const DebPackage& pkg, const std::string& outDir);
 
 // Version text carrying a build and small-fix number: base + "-" + build + "-s" + fix,
 // e.g. SmallFixVersion("6.1", 5644, 3) == "6.1-5644-s3".
@@ -50,12 +50,12 @@ std::string SmallFixVersion(const std::string& base, int build, int fix);
 // A package whose postinst appends one line "<package>\n" to orderLog (the folder of
 // orderLog must exist when the package is installed).  Installing several such packages
 // and reading orderLog shows the order in which they were configured.
-DebSpec OrderLoggingDeb(const std::string& package, const std::string& version,
-                        const std::string& orderLog);
+DebPackage OrderLoggingDeb(const std::string& package, const std::string& version,
+                           const std::string& orderLog);
 
 // A package whose postinst exits 1, so `dpkg -i` of it fails (dpkg exits non-zero and
 // leaves the package half-configured).
-DebSpec FailingDeb(const std::string& package, const std::string& version);
+DebPackage FailingDeb(const std::string& package, const std::string& version);
 
 }  // namespace kytotest
 
