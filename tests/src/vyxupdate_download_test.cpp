@@ -153,6 +153,9 @@ TEST_F(VyxServerTest, FeedThatCannotBeFetchedFailsTheCheck) {
          "(autoupgrade)' -O /var/run/autoupdate_tmp_file_RSS "
          "http://update.kyto.local/autoupdate/genRSS.php?tz=Europe/Berlin 2> /dev/null]. [0x"},
         {server->Url(kFeedPath), server->Url(kFeedPath) + "?tz=Europe/Berlin 2> /dev/null]"},
+        // A server that is down: nothing listens on port 1.
+        {"http://127.0.0.1:1/autoupdate/genRSS.php",
+         "http://127.0.0.1:1/autoupdate/genRSS.php?tz=Europe/Berlin 2> /dev/null]"},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.rssServer);
