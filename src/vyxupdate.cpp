@@ -905,6 +905,34 @@ bool VyxUpdate::SetStatusKey(const char* key, const char* value) {
     return false;
 }
 
+int VyxUpdate::FetchImage(const _tag_vyxinfo_& release, const std::string& folder, int number,
+                          const char* recordKey, Json::Value& record, bool& cancelled) {
+    std::string outputPath;
+    if (!GetOutputFilePath(release.link, folder, outputPath)) {
+        syslog(LOG_ERR, "%s:%d Fail to get output file path", kModule, __LINE__);
+        return 0;
+    }
+    if (!SetStatusKey(kyto::kKeyPatchPath, outputPath.c_str()) ||
+        !SetStatusKey(kyto::kKeyDownloadNum, number == 1 ? "1" : "2")) {
+        return 0;
+    }
+    if (!ExecWgetWithRetry(outputPath, release.link, cancelled)) {
+        if (number == 1)
+            syslog(LOG_ERR, "%s:%d Fail to download patch file", kModule, __LINE__);
+        else
+            syslog(LOG_ERR, "%s:%d Fail to download patch file for passive", kModule, __LINE__);
+        return 0;
+    }
+    if (cancelled)
+        return 1;
+    record[recordKey] = outputPath;
+    if (VerifyChecksum(release.checksum, outputPath.c_str()) != 1) {
+        syslog(LOG_ERR, "%s:%d Fail to verify checksum", kModule, __LINE__);
+        return 0;
+    }
+    return 1;
+}
+
 int VyxUpdate::DownloadImages(Json::Value& record, bool& cancelled) {
     bool canStart = false;
     if (!PreCheckDownload(canStart)) {
@@ -929,48 +957,12 @@ int VyxUpdate::DownloadImages(Json::Value& record, bool& cancelled) {
         return 0;
     }
 
-    std::string outputPath;
-    if (!GetOutputFilePath(m_release.link, folder, outputPath)) {
-        syslog(LOG_ERR, "%s:%d Fail to get output file path", kModule, __LINE__);
-        return 0;
-    }
-    if (!SetStatusKey(kyto::kKeyPatchPath, outputPath.c_str()) ||
-        !SetStatusKey(kyto::kKeyDownloadNum, "1")) {
-        return 0;
-    }
-    if (!ExecWgetWithRetry(outputPath, m_release.link, cancelled)) {
-        syslog(LOG_ERR, "%s:%d Fail to download patch file", kModule, __LINE__);
-        return 0;
-    }
-    if (cancelled)
-        return 1;
-    record["patchPath"] = outputPath;
-    if (VerifyChecksum(m_release.checksum, outputPath.c_str()) != 1) {
-        syslog(LOG_ERR, "%s:%d Fail to verify checksum", kModule, __LINE__);
-        return 0;
-    }
-
-    if (m_hybridDL) {
-        std::string passivePath;
-        if (!GetOutputFilePath(m_partnerRelease.link, folder, passivePath)) {
-            syslog(LOG_ERR, "%s:%d Fail to get output file path", kModule, __LINE__);
-            return 0;
-        }
-        if (!SetStatusKey(kyto::kKeyPatchPath, passivePath.c_str()) ||
-            !SetStatusKey(kyto::kKeyDownloadNum, "2")) {
-            return 0;
-        }
-        if (!ExecWgetWithRetry(passivePath, m_partnerRelease.link, cancelled)) {
-            syslog(LOG_ERR, "%s:%d Fail to download patch file for passive", kModule, __LINE__);
-            return 0;
-        }
-        if (cancelled)
-            return 1;
-        record["passivePatchPath"] = passivePath;
-        if (VerifyChecksum(m_partnerRelease.checksum, passivePath.c_str()) != 1) {
-            syslog(LOG_ERR, "%s:%d Fail to verify checksum", kModule, __LINE__);
-            return 0;
-        }
+    if (!FetchImage(m_release, folder, 1, "patchPath", record, cancelled) || cancelled)
+        return cancelled ? 1 : 0;
+    if (m_hybridDL &&
+        (!FetchImage(m_partnerRelease, folder, 2, "passivePatchPath", record, cancelled) ||
+         cancelled)) {
+        return cancelled ? 1 : 0;
     }
 
     if (!SetStatusKey(kyto::kKeyDownloadStatus, "finish"))

@@ -133,6 +133,11 @@ class VyxUpdate {
   private:
     // Steps 1-9 of DownloadVyx; the caller runs the end steps.  Fills the result record.
     int DownloadImages(Json::Value& record, bool& cancelled);
+    // Fetches and verifies one image of the download (number 1: this device's, 2: the
+    // partner's) into folder, recording its path under recordKey.  1 fetched and verified
+    // (or cancelled, with cancelled set), 0 failed.
+    static int FetchImage(const _tag_vyxinfo_& release, const std::string& folder, int number,
+                          const char* recordKey, Json::Value& record, bool& cancelled);
     // Sets one status key and logs the platform error when that fails.
     static bool SetStatusKey(const char* key, const char* value);
     // True unless the configured upgrade type is exactly "all".

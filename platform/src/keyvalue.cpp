@@ -94,10 +94,8 @@ int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewl
     std::string cur;
     std::vector<char> chunk(16384);
     for (;;) {
-        ssize_t n = ::read(fd.get(), chunk.data(), chunk.size());
+        ssize_t n = ReadRetry(fd.get(), chunk.data(), chunk.size());
         if (n < 0) {
-            if (errno == EINTR)
-                continue;
             KYTO_FAIL(KYTO_ERR_FILE_READ);
             return -1;
         }

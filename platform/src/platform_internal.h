@@ -107,6 +107,15 @@ inline int OpenErrorCode(int err, int otherwise) {
     return err == ENOENT || err == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND : otherwise;
 }
 
+// read(2) that retries when a signal interrupts it.
+inline ssize_t ReadRetry(int fd, void* buf, size_t size) {
+    ssize_t n;
+    do {
+        n = ::read(fd, buf, size);
+    } while (n < 0 && errno == EINTR);
+    return n;
+}
+
 // Opens an existing file that is not a folder for reading (O_CLOEXEC).  Returns an
 // invalid descriptor with the last error set (KYTO_ERR_FILE_NOT_FOUND or
 // KYTO_ERR_FILE_OPEN) on failure.

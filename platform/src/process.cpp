@@ -166,10 +166,8 @@ int KLIBCReadPidFile(const char* path) {
     std::string text;
     char buf[kPidFileMax + 1];
     while (text.size() <= kPidFileMax) {
-        ssize_t n = ::read(fd.get(), buf, sizeof buf);
+        ssize_t n = kytoplat::ReadRetry(fd.get(), buf, sizeof buf);
         if (n < 0) {
-            if (errno == EINTR)
-                continue;
             KYTO_FAIL(KYTO_ERR_FILE_READ);
             return -1;
         }
