@@ -39,6 +39,12 @@ class UpdateUtil {
     static void CheckDownloadedPatchType(PATCH_TYPE& type);
     // "<unique> VYX<major>.<minor> <build> (autoupgrade)"; 1 success, 0 failure.
     static int GetUserAgent(std::string& agent);
+
+    // Section and key of the interface's string table that name the service started by
+    // `script` (a start-up script's file name, e.g. "S80samba.sh"); 1 when the script is
+    // known, 0 (outputs untouched) when not.
+    static int GetServiceNameSectionKey(const std::string& script, std::string& section,
+                                        std::string& key);
 };
 
 #endif
