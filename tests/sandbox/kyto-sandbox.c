@@ -2,12 +2,19 @@
  * kyto-sandbox PROGRAM [ARGS...]
  *
  * Runs PROGRAM inside a disposable appliance root:
- *   - private mount namespace and a new pid namespace (the sandbox's init is our child;
- *     when it exits, every process left in the sandbox is killed by the kernel);
+ *   - private mount namespace, a new pid namespace (the sandbox's init is our child;
+ *     when it exits, every process left in the sandbox is killed by the kernel) and a
+ *     network namespace of its own with only the loopback interface, up (tests serve
+ *     and fetch on 127.0.0.1 and can reach nothing else);
  *   - an overlay file system whose lower layer is the host's "/" and whose upper layer
  *     lives on a scratch tmpfs that only this namespace sees, so every write vanishes;
- *   - fresh /proc, read-only /sys, a private /dev (a few device nodes, devpts, shm),
- *     fresh /run and /tmp;
+ *   - fresh /proc with /proc/sys and /proc/sysrq-trigger read-only, read-only /sys, a
+ *     private /dev (a few device nodes, devpts, shm), fresh and empty /run and /tmp;
+ *     every read-only mount is read-only with everything mounted below it;
+ *   - the test program and the provisioning script at their own paths, read-only, with
+ *     what lies beside them (a build tree and its shared libraries, the source tree);
+ *     when they live under /tmp or /run, only their top folder there is bound into the
+ *     fresh folder, so /tmp holds nothing else;
  *   - a syslog catcher on /dev/log that appends each message as one line to
  *     /var/log/sandbox.syslog (backslash and newline escaped as \\ and \n);
  *   - the marker file /.kyto-sandbox, then the provisioning script, then PROGRAM with
@@ -21,6 +28,7 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <limits.h>
+#include <net/if.h>
 #include <sched.h>
 #include <signal.h>
 #include <stdarg.h>
@@ -28,10 +36,12 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/ioctl.h>
 #include <sys/mount.h>
 #include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/syscall.h>
 #include <sys/types.h>
 #include <sys/un.h>
@@ -46,7 +56,8 @@
 #define EXEC_FAILED 127
 
 static const char* const kNeeds =
-    "needs root (CAP_SYS_ADMIN) and a kernel with overlayfs and mount/pid namespaces";
+    "needs root (CAP_SYS_ADMIN) and a kernel with overlayfs and mount, pid and network "
+    "namespaces";
 
 static volatile sig_atomic_t g_forward_pid = 0;
 
@@ -133,7 +144,75 @@ static void MakeDirs(const char* path) {
     MakeDir(buf, 0755);
 }
 
-/* Makes a mount read-only, with everything mounted below it when the kernel can. */
+/* The per-mount flags a bind remount would otherwise clear (nosuid, nodev, ...). */
+static unsigned long KeptMountFlags(const char* path) {
+    static const struct {
+        unsigned long st, ms;
+    } kFlags[] = {{ST_NOSUID, MS_NOSUID},     {ST_NODEV, MS_NODEV},
+                  {ST_NOEXEC, MS_NOEXEC},     {ST_NOATIME, MS_NOATIME},
+                  {ST_NODIRATIME, MS_NODIRATIME}, {ST_RELATIME, MS_RELATIME}};
+    struct statvfs vfs;
+    unsigned long flags = 0;
+    if (statvfs(path, &vfs) != 0)
+        return 0;
+    for (size_t i = 0; i < sizeof kFlags / sizeof kFlags[0]; ++i) {
+        if (vfs.f_flag & kFlags[i].st)
+            flags |= kFlags[i].ms;
+    }
+    return flags;
+}
+
+/* Decodes the octal escapes (\040 for a blank, ...) of a mount point in mountinfo. */
+static void DecodeMountPoint(char* s) {
+    char* out = s;
+    for (char* in = s; *in; ++out) {
+        if (in[0] == '\\' && in[1] >= '0' && in[1] <= '3' && in[2] >= '0' && in[2] <= '7' &&
+            in[3] >= '0' && in[3] <= '7') {
+            *out = (char)((in[1] - '0') * 64 + (in[2] - '0') * 8 + (in[3] - '0'));
+            in += 4;
+        } else {
+            *out = *in++;
+        }
+    }
+    *out = '\0';
+}
+
+/* Remounts read-only the mount at path and every mount below it, one by one: the way
+ * for kernels without mount_setattr. */
+static void RemountTreeReadOnly(const char* path) {
+    size_t n = strlen(path);
+    FILE* f = fopen("/proc/self/mountinfo", "re");
+    if (f == NULL)
+        Fail(NULL, "read /proc/self/mountinfo");
+    char line[3 * PATH_MAX];
+    while (fgets(line, sizeof line, f) != NULL) {
+        /* "id parent major:minor root mountpoint options ..." */
+        char* field = line;
+        for (int i = 0; i < 4 && field != NULL; ++i) {
+            field = strchr(field, ' ');
+            if (field != NULL)
+                ++field;
+        }
+        if (field == NULL)
+            continue;
+        char* end = strchr(field, ' ');
+        if (end == NULL)
+            continue;
+        *end = '\0';
+        DecodeMountPoint(field);
+        if (strncmp(field, path, n) != 0 || (field[n] != '\0' && field[n] != '/'))
+            continue;
+        unsigned long kept = KeptMountFlags(field);
+        if (mount(NULL, field, NULL, MS_REMOUNT | MS_BIND | MS_RDONLY | kept, NULL) != 0) {
+            fclose(f);
+            Fail(NULL, "remount %s read-only", field);
+        }
+    }
+    fclose(f);
+}
+
+/* Makes a mount read-only together with everything mounted below it: in one step where
+ * the kernel has mount_setattr, else mount by mount. */
 static void MakeReadOnly(const char* path) {
 #ifdef SYS_mount_setattr
     struct {
@@ -143,7 +222,7 @@ static void MakeReadOnly(const char* path) {
         0)
         return;
 #endif
-    Mount(NULL, path, NULL, MS_REMOUNT | MS_BIND | MS_RDONLY, NULL, NULL);
+    RemountTreeReadOnly(path);
 }
 
 static void BindReadOnly(const char* src, const char* dst) {
@@ -318,6 +397,14 @@ static void BuildRoot(const char* root_parent, const char* prog_real, const char
     Path(p, root, "/proc");
     MakeDirs(p);
     Mount("proc", p, "proc", MS_NOSUID | MS_NODEV | MS_NOEXEC, NULL, kNeeds);
+    /* A test can read kernel settings but never change the host's (most are not
+     * namespaced) nor reboot the host through sysrq (absent from kernels built without
+     * it). */
+    Path(p, root, "/proc/sys");
+    BindReadOnly(p, p);
+    Path(p, root, "/proc/sysrq-trigger");
+    if (access(p, F_OK) == 0)
+        BindReadOnly(p, p);
     Path(p, root, "/sys");
     MakeDirs(p);
     BindReadOnly("/sys", p);
@@ -405,6 +492,23 @@ static void StartSyslogCatcher(void) {
     close(logFd);
 }
 
+/* A new network namespace starts with its loopback interface down; the kernel gives it
+ * 127.0.0.1 when it goes up. */
+static void BringUpLoopback(void) {
+    int sock = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    if (sock < 0)
+        Fail(NULL, "create a socket to configure the loopback interface");
+    struct ifreq ifr;
+    memset(&ifr, 0, sizeof ifr);
+    strcpy(ifr.ifr_name, "lo");
+    if (ioctl(sock, SIOCGIFFLAGS, &ifr) != 0)
+        Fail(NULL, "read the flags of the loopback interface");
+    ifr.ifr_flags |= IFF_UP;
+    if (ioctl(sock, SIOCSIFFLAGS, &ifr) != 0)
+        Fail(NULL, "bring the loopback interface up");
+    close(sock);
+}
+
 static void Provision(void) {
     pid_t pid = fork();
     if (pid < 0)
@@ -460,8 +564,9 @@ int main(int argc, char** argv) {
     if (realpath(KYTO_PROVISION_SCRIPT, script_real) == NULL)
         Fail(NULL, "find the provisioning script %s", KYTO_PROVISION_SCRIPT);
 
-    if (unshare(CLONE_NEWNS | CLONE_NEWPID) != 0)
-        Fail(kNeeds, "create mount and pid namespaces");
+    if (unshare(CLONE_NEWNS | CLONE_NEWPID | CLONE_NEWNET) != 0)
+        Fail(kNeeds, "create mount, pid and network namespaces");
+    BringUpLoopback();
     if (mount(NULL, "/", NULL, MS_REC | MS_PRIVATE, NULL) != 0)
         Fail(kNeeds, "make the mounts private");
 
