@@ -13,6 +13,7 @@
 
 #include <kytoplatform/klibc.h>
 
+#include "child_process.h"
 #include "kyto_paths.h"
 #include "scoped.h"
 
@@ -44,41 +45,26 @@ bool DebianLib::ExecDpkg(const std::string& option, const std::string& package,
     WriteUpdateLog(" ===========[" + option + " " + package + " " + folder + "]===========",
                    kyto::kDpkgLog);
 
-    // Everything the child needs is prepared here: after fork only async-signal-safe
-    // calls are made, no allocation.
-    const char* const logPath = kyto::kDpkgLog;
-    const char* const opt = option.c_str();
-    const char* const pkg = package.c_str();
-    const char* const dir = folder.empty() ? nullptr : folder.c_str();
-
-    pid_t pid = fork();
-    if (pid < 0) {
+    // The package tool's output and errors go to the upgrade log for the support staff;
+    // when the log cannot be opened it writes to this process's own descriptors.  Its
+    // standard input is /dev/null, so a configuration-file prompt can never hang an apply.
+    kyto::UniqueFd log(open(kyto::kDpkgLog, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+    const int output = log.valid() ? log.get() : kyto::kChildInherit;
+    const char* argv[] = {kDpkgPath, option.c_str(), package.c_str(),
+                          folder.empty() ? nullptr : folder.c_str(), nullptr};
+    kyto::ChildSetup setup;
+    setup.program = kDpkgPath;
+    setup.argv = const_cast<char* const*>(argv);
+    setup.stdoutFd = output;
+    setup.stderrFd = output;
+    kyto::ChildProcess dpkg;
+    if (dpkg.Start(setup) != kyto::ChildProcess::kStarted) {
         syslog(LOG_ERR, "%s:%d Fail to fork", kModule, __LINE__);
         return false;
     }
-    if (pid == 0) {
-        int fd = open(logPath, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
-        if (fd >= 0) {
-            dup2(fd, STDOUT_FILENO);
-            dup2(fd, STDERR_FILENO);
-            if (fd > STDERR_FILENO) {
-                close(fd);
-            } else {
-                // The log landed on 1 or 2 itself: dup2 onto the same number keeps the
-                // close-on-exec flag, so drop it by hand.
-                fcntl(fd, F_SETFD, 0);
-            }
-        }
-        if (dir != nullptr) {
-            execl(kDpkgPath, kDpkgPath, opt, pkg, dir, static_cast<char*>(nullptr));
-        } else {
-            execl(kDpkgPath, kDpkgPath, opt, pkg, static_cast<char*>(nullptr));
-        }
-        _exit(1);
-    }
 
     int status = 0;
-    if (kyto::WaitForChild(pid, &status) < 0) {
+    if (dpkg.Wait(&status) < 0) {
         syslog(LOG_ERR, "%s:%d Fail to exec [dpkg %s %s] error=[%m]", kModule, __LINE__,
                option.c_str(), package.c_str());
         return false;

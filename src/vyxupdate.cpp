@@ -31,6 +31,7 @@
 #include <kytoplatform/kyto_system.h>
 #include <kytoplatform/kytoconf.h>
 
+#include "child_process.h"
 #include "kyto_paths.h"
 #include "scoped.h"
 #include "update_cpputil.h"
@@ -158,16 +159,8 @@ struct MntentClose {
     void operator()(FILE* f) const { endmntent(f); }
 };
 
-// Opens path close-on-exec at a descriptor above the standard ones, so that making it the
-// child's standard error or output cannot overwrite the other one when the caller runs
-// with a standard descriptor closed.
-int OpenAboveStd(const char* path) {
-    int fd = open(path, O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-    if (fd < 0 || fd > STDERR_FILENO)
-        return fd;
-    int moved = fcntl(fd, F_DUPFD_CLOEXEC, STDERR_FILENO + 1);
-    close(fd);
-    return moved;
+void LogPidFileOpenFailure() {
+    syslog(LOG_ERR, "%s:%d Fail to open [%s] for writing", kModule, __LINE__, kPidFile);
 }
 
 }  // namespace
@@ -785,40 +778,36 @@ bool VyxUpdate::GetDownloadedPatchPath(bool& have, std::string& path) {
 
 bool VyxUpdate::ExecWgetP(std::string outputPath, std::string url, bool& cancelled) {
     cancelled = false;
-    pid_t pid = fork();
-    if (pid < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to fork", kModule, __LINE__);
-        return false;
-    }
-    if (pid == 0) {
-        // wget's progress goes to the progress log (read by GetDownloadPercentage), its
-        // standard output is discarded.
-        // dup2 leaves close-on-exec off on the copies.
-        int progress = OpenAboveStd(kProgressLog);
-        int devNull = OpenAboveStd("/dev/null");
-        if (progress >= 0) {
-            dup2(progress, STDERR_FILENO);
-            close(progress);
-        }
-        if (devNull >= 0) {
-            dup2(devNull, STDOUT_FILENO);
-            close(devNull);
-        }
-        if (!WriteDownloadPidFile()) {
-            syslog(LOG_ERR, "%s:%d Fail to write pid file", kModule, __LINE__);
-            // Long-standing behaviour, kept deliberately: the child reports the failure
-            // by returning false from this call instead of ending, so it carries on in
-            // the caller's code (and its retry loop) as a second process.
+    // wget's progress goes to the progress log (read by GetDownloadPercentage in the
+    // pollers), its standard output is discarded.  When the log cannot be opened wget
+    // keeps this process's standard error.
+    kyto::UniqueFd progress(open(kProgressLog, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    const char* argv[] = {kWget,          "-O",        outputPath.c_str(), url.c_str(),
+                          "--timeout=15", "--tries=1", "--no-dns-cache",   nullptr};
+    kyto::ChildSetup setup;
+    setup.program = kWget;
+    setup.argv = const_cast<char* const*>(argv);
+    setup.stdoutFd = kyto::kChildDevNull;
+    setup.stderrFd = progress.valid() ? progress.get() : kyto::kChildInherit;
+    setup.pidFile = kPidFile;
+    kyto::ChildProcess wget;
+    switch (wget.Start(setup)) {
+        case kyto::ChildProcess::kForkFailed:
+            syslog(LOG_ERR, "%s:%d Fail to fork", kModule, __LINE__);
             return false;
-        }
-        const char* argv[] = {kWget,          "-O",        outputPath.c_str(), url.c_str(),
-                              "--timeout=15", "--tries=1", "--no-dns-cache",   nullptr};
-        execv(kWget, const_cast<char* const*>(argv));
-        _exit(1);
+        case kyto::ChildProcess::kInChildPidFileFailed:
+            // This is the child.  It reports the failure by returning false instead of
+            // ending, so it carries on in the caller's code (and its retry loop) as a
+            // second process: callers and log readers have always seen it that way.
+            LogPidFileOpenFailure();
+            syslog(LOG_ERR, "%s:%d Fail to write pid file", kModule, __LINE__);
+            return false;
+        case kyto::ChildProcess::kStarted:
+            break;
     }
 
     int status = 0;
-    if (kyto::WaitForChild(pid, &status) < 0) {
+    if (wget.Wait(&status) < 0) {
         syslog(LOG_ERR, "%s:%d Fail to download VYX patch [%m]", kModule, __LINE__);
         KLIBCExec("/bin/rm", "-f", outputPath.c_str(), nullptr, nullptr);
         return false;
@@ -877,7 +866,7 @@ int VyxUpdate::VerifyChecksum(const char* expected, const char* path) {
 bool VyxUpdate::WriteDownloadPidFile() {
     kyto::UniqueFile file(fopen(kPidFile, "we"));
     if (!file) {
-        syslog(LOG_ERR, "%s:%d Fail to open [%s] for writing", kModule, __LINE__, kPidFile);
+        LogPidFileOpenFailure();
         return false;
     }
     fprintf(file.get(), "%d", static_cast<int>(getpid()));
