@@ -10,7 +10,7 @@ PREFIX=${PREFIX:-/usr/local}
 kyto_install_packages "${KYTO_BUILD_PACKAGES[@]}"
 
 echo "== configure (build/)"
-cmake -S . -B build -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_BUILD_TESTS=OFF \
+cmake -S . -B build -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_BUILD_TESTS=OFF -DKYTO_WERROR=ON \
     -DCMAKE_INSTALL_PREFIX="$PREFIX" >/dev/null
 echo "== build"
 cmake --build build -j"$(nproc)"
@@ -19,4 +19,9 @@ cmake --install build >/dev/null
 ldconfig 2>/dev/null || true
 
 echo "build.sh: done. The command-line driver is not built yet; the library is installed in" \
-    "$PREFIX (libkytoinstallcpp, libkytoplatform, headers, pkg-config file kytoinstallcpp.pc)."
+    "$PREFIX (libkytoinstallcpp, libkytoplatform, headers, pkg-config file kytoinstallcpp.pc," \
+    "CMake package kytoinstallcpp)."
+if [ "$PREFIX" != /usr/local ] && [ "$PREFIX" != /usr ]; then
+    echo "build.sh: the libraries carry no run path; programs find them in $PREFIX with" \
+        "LD_LIBRARY_PATH or an ld.so.conf entry."
+fi

@@ -69,32 +69,51 @@ if [ $SANITIZE -eq 1 ]; then
     export UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1
     step "configure $BUILD (AddressSanitizer + UndefinedBehaviorSanitizer)"
     cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=Debug -DKYTO_SANITIZE=ON -DKYTO_BUILD_TESTS=ON \
-        >/dev/null
+        -DKYTO_WERROR=ON >/dev/null
 else
     BUILD=$ROOT/build
     step "configure $BUILD"
     cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_SANITIZE=OFF \
-        -DKYTO_BUILD_TESTS=ON >/dev/null
+        -DKYTO_BUILD_TESTS=ON -DKYTO_WERROR=ON >/dev/null
 fi
 step "build (-j$JOBS)"
 cmake --build "$BUILD" -j"$JOBS"
 
 if [ $SANITIZE -eq 0 ]; then
-    # Install into a scratch prefix and build a program against it from outside the tree,
-    # through pkg-config only.
+    # Install into a scratch prefix and build the same program against it from outside the
+    # tree twice: through pkg-config, and through find_package(kytoinstallcpp).  Nothing
+    # carries a run path, so both run with the prefix's library folder in LD_LIBRARY_PATH.
     STAGE=$(mktemp -d /tmp/kyto-install.XXXXXX)
     trap 'rm -rf "$STAGE"' EXIT
-    step "install into $STAGE, build and run tests/consumer/app.cpp against it"
+    step "install into $STAGE"
     cmake --install "$BUILD" --prefix "$STAGE/prefix" >/dev/null
-    PCDIR=$(dirname "$(find "$STAGE/prefix" -name kytoinstallcpp.pc | head -n1)")
-    cp tests/consumer/app.cpp "$STAGE/app.cpp"
+    LIBDIR=$(dirname "$(find "$STAGE/prefix" -name 'libkytoinstallcpp.so' | head -n1)")
+    for lib in "$LIBDIR"/libkytoinstallcpp.so "$LIBDIR"/libkytoplatform.so; do
+        if readelf -d "$lib" | grep -qE 'RPATH|RUNPATH'; then
+            echo "$lib carries a run path" >&2
+            false
+        fi
+        # Internal helpers (namespace kyto) stay out of the dynamic symbol table.
+        if nm -D -C --defined-only "$lib" | grep -q ' kyto::'; then
+            echo "$lib exports internal symbols:" >&2
+            nm -D -C --defined-only "$lib" | grep ' kyto::' | head -5 >&2
+            false
+        fi
+    done
+    step "build and run tests/consumer/app.cpp with pkg-config"
+    cp tests/consumer/app.cpp tests/consumer/CMakeLists.txt "$STAGE/"
     (
         cd "$STAGE"
-        export PKG_CONFIG_PATH=$PCDIR
+        export PKG_CONFIG_PATH=$LIBDIR/pkgconfig
         # shellcheck disable=SC2046
-        g++ -std=c++17 -Wall -Wextra -Werror app.cpp -o app $(pkg-config --cflags --libs kytoinstallcpp)
-        ./app
+        g++ -std=c++17 -Wall -Wextra -Werror app.cpp -o app-pkgconfig \
+            $(pkg-config --cflags --libs kytoinstallcpp)
+        LD_LIBRARY_PATH=$LIBDIR ./app-pkgconfig
     )
+    step "build and run tests/consumer/app.cpp with find_package(kytoinstallcpp)"
+    cmake -S "$STAGE" -B "$STAGE/build" -DCMAKE_PREFIX_PATH="$STAGE/prefix" >/dev/null
+    cmake --build "$STAGE/build" >/dev/null
+    LD_LIBRARY_PATH=$LIBDIR "$STAGE/build/app"
 fi
 
 step "ctest (-j2)"

@@ -9,7 +9,9 @@
 
 #include <json/json.h>
 
-class CustomBugFix {
+#include "kyto_export.h"
+
+class KYTO_EXPORT CustomBugFix {
   public:
     explicit CustomBugFix(int curSmallFixNumber);
 

@@ -6,7 +6,9 @@
 
 #include <string>
 
-class DebianLib {
+#include "kyto_export.h"
+
+class KYTO_EXPORT DebianLib {
   public:
     // Appends "<local time>\t<text>" to logPath.
     static void WriteUpdateLog(const std::string& text, const std::string& logPath);

@@ -9,7 +9,9 @@
 
 #include <kytoplatform/kytoconf.h>
 
-class SmallUpdate {
+#include "kyto_export.h"
+
+class KYTO_EXPORT SmallUpdate {
   public:
     // Download state, written as a number into "/var/run/downloadVYX.status".
     enum DOWNLOAD_STATUS {

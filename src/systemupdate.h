@@ -6,10 +6,11 @@
 
 #include <string>
 
+#include "kyto_export.h"
 #include "smallupdate.h"
 #include "vyxupdate.h"
 
-class SystemUpdate {
+class KYTO_EXPORT SystemUpdate {
   public:
     SystemUpdate();
 

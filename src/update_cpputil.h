@@ -9,7 +9,9 @@
 
 #include <json/json.h>
 
-class UpdateUtil {
+#include "kyto_export.h"
+
+class KYTO_EXPORT UpdateUtil {
   public:
     // Kind of a downloaded update; the facade numbers its update type the same way.
     enum PATCH_TYPE {

@@ -7,6 +7,8 @@
 
 #include <json/json.h>
 
+#include "kyto_export.h"
+
 // Version record of one release: fixed-size NUL-terminated text fields.  Callers zero
 // the whole record before use.
 struct _tag_vyxinfo_ {
@@ -61,7 +63,7 @@ enum _tag_update_step_ {
     UPDATE_STEP_R = 6,
 };
 
-class VyxUpdate {
+class KYTO_EXPORT VyxUpdate {
   public:
     // In-memory download state of the full release (never written to a file as a number).
     enum VYX_DOWNLOAD_STATUS {

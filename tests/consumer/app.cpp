@@ -1,5 +1,7 @@
-// A program built outside the source tree against the installed library, through
-// pkg-config only: proves that the installed headers and libraries are complete.
+// A program built outside the source tree against the installed library, once through
+// pkg-config and once through find_package (CMakeLists.txt beside it): proves that the
+// installed headers, libraries and both package descriptions are complete, and that the
+// exported symbols are the ones a program needs.
 //   g++ app.cpp $(pkg-config --cflags --libs kytoinstallcpp)
 #include <stdio.h>
 #include <stdlib.h>
@@ -15,6 +17,7 @@
 #include <update_cpputil.h>
 #include <vyxupdate.h>
 #include <kytoplatform/klibc.h>
+#include <kytoplatform/kytoconf.h>
 
 static int g_failures = 0;
 
@@ -50,6 +53,8 @@ int main() {
         KLIBCSzListFree(list);
     }
     Check(KLIBCSzListAlloc(0) == nullptr, "KLIBCSzListAlloc(0) refused");
+    Check(KytoConf().Def("no_such_key_in_any_model", "fallback") == "fallback",
+          "KytoConf::Def of a missing key");
 
     printf("consumer: %s\n", g_failures == 0 ? "all checks passed" : "checks FAILED");
     return g_failures == 0 ? 0 : 1;

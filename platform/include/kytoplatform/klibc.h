@@ -10,6 +10,9 @@
 
 #include <sys/types.h>
 
+/* Built with hidden symbols by default: every call declared here is exported. */
+#pragma GCC visibility push(default)
+
 #ifdef __cplusplus
 extern "C" {
 #endif
@@ -113,5 +116,7 @@ void KLIBCSzListFree(PKLIBC_SZLIST list);
 #ifdef __cplusplus
 }
 #endif
+
+#pragma GCC visibility pop
 
 #endif

@@ -8,6 +8,9 @@
 
 #include <sys/types.h>
 
+/* Built with hidden symbols by default: every call declared here is exported. */
+#pragma GCC visibility push(default)
+
 #ifdef __cplusplus
 extern "C" {
 #endif
@@ -85,5 +88,7 @@ int KYTOServiceThirdPartyAll(int blStart);
 #ifdef __cplusplus
 }
 #endif
+
+#pragma GCC visibility pop
 
 #endif

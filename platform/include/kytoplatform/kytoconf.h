@@ -7,6 +7,9 @@
 #ifdef __cplusplus
 #include <string>
 
+/* Built with hidden symbols by default: the class is exported. */
+#pragma GCC visibility push(default)
+
 class KytoConf {
   public:
     static constexpr const char* kDefaultsPath = "/etc.defaults/kytoinfo.conf";
@@ -17,6 +20,8 @@ class KytoConf {
     /* The value in /etc/kytoinfo.conf when present there, else as Def. */
     std::string Info(const std::string& key, const std::string& def);
 };
+
+#pragma GCC visibility pop
 #endif
 
 #endif
