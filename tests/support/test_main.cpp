@@ -11,8 +11,10 @@
 // walk stopped; the nodes before it (all of them when no volume qualified) stay allocated
 // on purpose, which is harmless in the short-lived processes that use it.  The sanitizer
 // build ignores only leaks whose allocation passed through that one function (its
-// qualified name, matched from the start); every other leak fails the test.
-extern "C" const char* __lsan_default_suppressions() {
+// qualified name, matched from the start); every other leak fails the test.  The hook is
+// looked up by the sanitizer runtime at run time, so it must stay visible in a build with
+// hidden symbols.
+extern "C" __attribute__((visibility("default"))) const char* __lsan_default_suppressions() {
     return "leak:^UpdateUtil::IsThereAvailVolPath(\n";
 }
 
