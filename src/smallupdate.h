@@ -43,6 +43,47 @@ class KYTO_EXPORT SmallUpdate {
     bool ImportInfoFile(const char* path);
     bool DumpToInfoFile(bool blPassive);
 
+    // ---- Patch list lookup ----
+    // Fetches this build's and model's patch list from the update server and fills the
+    // record from it.
+    bool LookUpServer();
+    // Fetches the patch list into outPath; a 404 answer (no list) fails without a log line.
+    bool DownloadJson(const std::string& outPath);
+    // Validates a patch-list file (model, build) and fills the record with the merge of
+    // its entries newer than the installed fix.
+    bool SetUpdateList(const std::string& path);
+    // True when the record's fix is newer than the installed one.
+    bool CheckHaveSmallFix();
+    bool HaveNewFix();
+    // isSmallUpdate tells whether the archive holds a patch list.
+    static bool CheckPatchIsSmallUpdate(const std::string& archive, bool& isSmallUpdate);
+    // Imports a locally supplied patch archive (patch list and packages) as if downloaded.
+    bool ImportSmallPatch(const std::string& archive, const std::string& folderName,
+                          bool blPassive);
+    bool ImportSmallPatch(const std::string& archive);
+    // "VYX <major>.<minor>-<build> update <fix>", or "" when the record holds no fix.
+    std::string GetFullVersion();
+
+    // ---- Small-update download ----
+    // One wget attempt of link into folder; a partial file never stays.
+    static bool ExecWgetP(const std::string& link, const std::string& folder);
+    // Up to ten attempts; true at once when the stop marker appears.
+    static bool ExecWgetWithRetry(const std::string& link, const std::string& folder);
+    // Fetches every package of the record into m_debDir; stopped tells a stop by marker.
+    bool DownloadFiles(bool& stopped);
+    bool Download(bool blDump, const std::string& folderName, bool blPassive);
+    bool Download(bool blDump);
+    // Percentage and state word of the download, for the interface's poller.
+    void GetDownloadStatus(int& percentage, std::string& status);
+    // Asks a running download (in any process) to stop.
+    bool CancelDownload();
+    // True when a downloaded update's packages are in place.
+    bool IsReadyApply();
+
+    // ---- Apply ----
+    // Flash, unpack, configuration, packages, the new small-fix number; true when installed.
+    bool Apply();
+
     // ---- Download status file (writer) ----
     static int UpdateDownloadProgress(int percentage, DOWNLOAD_STATUS status);
 

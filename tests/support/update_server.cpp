@@ -204,6 +204,18 @@ void UpdateServer::SlowPath(const std::string& urlPath, long bytesPerSecond) {
     WriteControl(root_, control);
 }
 
+void UpdateServer::TruncatePath(const std::string& urlPath, long bytes) {
+    Json::Value control = ReadJson(root_ + kControlFile);
+    control["truncate"][urlPath] = static_cast<Json::Int64>(bytes);
+    WriteControl(root_, control);
+}
+
+void UpdateServer::StallPath(const std::string& urlPath, long bytes) {
+    Json::Value control = ReadJson(root_ + kControlFile);
+    control["stall"][urlPath] = static_cast<Json::Int64>(bytes);
+    WriteControl(root_, control);
+}
+
 std::vector<UpdateServer::Request> UpdateServer::Requests() const {
     std::vector<Request> out;
     std::ifstream in(root_ + kRequestLog);
@@ -241,6 +253,38 @@ void UpdateServer::ClearRequests() {
 
 void UpdateServer::PointRssServerHere() const {
     SetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server", Url("/autoupdate/genRSS.php"));
+}
+
+void UpdateServer::PointSmallInfoPathHere() const {
+    SetKeyValue("/etc.defaults/kytoinfo.conf", "small_info_path", Url("/smallupdate"));
+}
+
+std::string UpdateServer::PatchListPath(int build, const std::string& unique) {
+    return "/smallupdate/" + std::to_string(build) + "/" + unique + "/VYX-Security.json";
+}
+
+std::string PatchListJson(int build, const std::string& unique,
+                          const std::vector<PatchEntry>& entries) {
+    Json::Value root(Json::objectValue);
+    root["vyxversion"] = build;
+    root["unique"] = unique;
+    root["smallupdate"] = Json::Value(Json::arrayValue);
+    for (const PatchEntry& e : entries) {
+        Json::Value entry(Json::objectValue);
+        entry["version"] = e.version;
+        entry["flash_upgrade"] = e.flash;
+        entry["config_upgrade"] = e.config;
+        entry["proj"] = Json::Value(Json::arrayValue);
+        for (const auto& p : e.proj) {
+            Json::Value item(Json::objectValue);
+            item["name"] = p.first;
+            item["url"] = p.second;
+            entry["proj"].append(item);
+        }
+        Json::Reader().parse(e.restart, entry["restart"], false);
+        root["smallupdate"].append(entry);
+    }
+    return Json::FastWriter().write(root);
 }
 
 }  // namespace kytotest

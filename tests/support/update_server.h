@@ -9,9 +9,23 @@
 #include <sys/types.h>
 
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace kytotest {
+
+// One entry of a patch list ("VYX-Security.json"): proj holds (name, url) pairs, restart
+// is raw JSON ("\"reboot\"", "{\"vyx_service\":[...],\"pkg\":[]}", ...).
+struct PatchEntry {
+    int version = 0;
+    std::vector<std::pair<std::string, std::string>> proj;
+    bool flash = false;
+    bool config = false;
+    std::string restart = "\"none\"";
+};
+// The patch-list document for a build and model holding the entries in order.
+std::string PatchListJson(int build, const std::string& unique,
+                          const std::vector<PatchEntry>& entries);
 
 class UpdateServer {
   public:
@@ -49,6 +63,10 @@ class UpdateServer {
     void FailPath(const std::string& urlPath, int status, int times = -1);
     // Sends the body of urlPath at about bytesPerSecond (in small chunks, flushing each).
     void SlowPath(const std::string& urlPath, long bytesPerSecond);
+    // Announces the whole body of urlPath but sends only its first `bytes`, then closes.
+    void TruncatePath(const std::string& urlPath, long bytes);
+    // Sends the headers and the first `bytes` of urlPath, then nothing more.
+    void StallPath(const std::string& urlPath, long bytes);
     // Every request seen so far, in arrival order.
     std::vector<Request> Requests() const;
     // Requests for one path.
@@ -58,6 +76,11 @@ class UpdateServer {
     // Points the appliance at this server: sets rss_server="<BaseUrl>/autoupdate/genRSS.php"
     // in /etc.defaults/kytoinfo.conf.
     void PointRssServerHere() const;
+    // Points the small-update lookup at this server: small_info_path="<BaseUrl>/smallupdate".
+    void PointSmallInfoPathHere() const;
+    // URL path of the patch list the lookup fetches for a build and model:
+    // "/smallupdate/<build>/<unique>/VYX-Security.json".
+    static std::string PatchListPath(int build, const std::string& unique);
 
   private:
     void Start();

@@ -9,7 +9,9 @@ ignored when a path is matched).  Two files in ROOT steer it:
 
   .control.json  re-read on every request:
                  {"fail": {"/path": {"status": 503, "times": 2}},   # times < 0: always
-                  "slow": {"/path": 4096}}                          # bytes per second
+                  "slow": {"/path": 4096},                          # bytes per second
+                  "truncate": {"/path": 10},   # send 10 body bytes, then close
+                  "stall": {"/path": 10}}      # send 10 body bytes, then nothing
   .requests.log  one JSON object per request, appended before the answer is sent:
                  {"method", "path", "query", "user_agent", "status"}
 
@@ -30,6 +32,7 @@ from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 CONTROL = ".control.json"
 REQUEST_LOG = ".requests.log"
 BLOCK = 1 << 16
+STALL_SECONDS = 600  # longer than any client time-out; the server dies with its test
 
 _lock = threading.Lock()
 
@@ -135,7 +138,10 @@ class Handler(BaseHTTPRequestHandler):
             status = 206
         length = end - start + 1 if size else 0
 
-        rate = _read_control(self.server.root).get("slow", {}).get(path)
+        control = _read_control(self.server.root)
+        rate = control.get("slow", {}).get(path)
+        cut = control.get("truncate", {}).get(path)
+        stall = control.get("stall", {}).get(path)
         self._record(path, query, status)
         self.send_response(status)
         self.send_header("Content-Type", "application/octet-stream")
@@ -148,6 +154,14 @@ class Handler(BaseHTTPRequestHandler):
         try:
             with open(local, "rb") as f:
                 f.seek(start)
+                if cut is not None or stall is not None:
+                    # The announced length is never reached: a broken or hung server.
+                    self._stream(f, min(length, int(cut if cut is not None else stall)), rate)
+                    self.wfile.flush()
+                    if stall is not None:
+                        time.sleep(STALL_SECONDS)
+                    self.close_connection = True
+                    return
                 self._stream(f, length, rate)
         except (BrokenPipeError, ConnectionResetError):
             pass  # the client went away (cancelled download)

@@ -1,0 +1,351 @@
+// SmallUpdate: finding a small update.  The patch list "VYX-Security.json" that the update
+// server publishes for this build and model (or that a local patch archive carries) is
+// fetched, validated and merged into the record; the record's fix is then compared with
+// the one installed.
+#include "smallupdate.h"
+
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <mutex>
+#include <string>
+
+#include <curl/curl.h>
+#include <json/json.h>
+#include <kytoplatform/klibc.h>
+
+#include "custombugfix.h"
+#include "kyto_paths.h"
+#include "scoped.h"
+#include "update_cpputil.h"
+#include "vyxupdate.h"
+
+namespace {
+
+constexpr const char* kModule = "smallupdate";
+
+// Base address of the patch lists when "small_info_path" is not configured.
+constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
+constexpr const char* kPatchListName = "VYX-Security.json";
+constexpr const char* kDefaultDebDirName = "/@smallupd@te_deb";
+
+// A patch list is a few kilobytes: a server that does not connect within this time, or
+// sends nothing for kLowSpeedSeconds, or has not finished after kTransferSeconds, is
+// treated as a failed transfer instead of blocking the caller (the interface's check, the
+// scheduled job) for good.
+constexpr long kConnectSeconds = 15;
+constexpr long kLowSpeedSeconds = 15;
+constexpr long kTransferSeconds = 60;
+
+// libcurl's global state is set up once per process, before the first handle.  It is
+// never torn down: the library may be unloaded while its host still uses libcurl.
+void InitCurlOnce() {
+    static std::once_flag once;
+    std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
+}
+
+// Owns one easy handle.
+class CurlEasy {
+  public:
+    CurlEasy() : handle_(curl_easy_init()) {}
+    ~CurlEasy() {
+        if (handle_)
+            curl_easy_cleanup(handle_);
+    }
+    CurlEasy(const CurlEasy&) = delete;
+    CurlEasy& operator=(const CurlEasy&) = delete;
+    CURL* get() const { return handle_; }
+
+  private:
+    CURL* handle_;
+};
+
+// Installed small-fix number: "smallfixnumber" of the version file, 0 when it yields nothing.
+int InstalledSmallFixNumber() {
+    char buf[32] = {0};
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", buf, sizeof(buf), 0) <= 0) {
+        return 0;
+    }
+    return static_cast<int>(strtol(buf, nullptr, 10));
+}
+
+}  // namespace
+
+bool SmallUpdate::DownloadJson(const std::string& outPath) {
+    const std::string base = m_conf.Def("small_info_path", kDefaultSmallInfoPath);
+    if (outPath.empty()) {
+        syslog(LOG_ERR, "%s:%d bad parameter", kModule, __LINE__);
+        m_errno = 3;
+        return false;
+    }
+    char buildNumber[64] = {0};
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buildNumber, sizeof(buildNumber),
+                             0) < 0) {
+        syslog(LOG_ERR, "%s:%d Get buildnumber Fail[0x%04X %s:%d]", kModule, __LINE__,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        m_errno = 3;
+        return false;
+    }
+    const std::string url =
+        base + "/" + buildNumber + "/" + m_unique + "/" + kPatchListName;
+
+    InitCurlOnce();
+    CurlEasy curl;
+    if (!curl.get()) {
+        syslog(LOG_ERR, "%s:%d failed to init curl", kModule, __LINE__);
+        return false;
+    }
+    kyto::UniqueFile out(fopen(outPath.c_str(), "we"));
+    if (!out) {
+        syslog(LOG_ERR, "%s:%d failed to open %s", kModule, __LINE__, outPath.c_str());
+        return false;
+    }
+
+    // The body goes straight into the file through libcurl's default writer.  Redirects
+    // are not followed.  No signals: the caller may be a threaded program.
+    char errorText[CURL_ERROR_SIZE] = {0};
+    curl_easy_setopt(curl.get(), CURLOPT_URL, url.c_str());
+    curl_easy_setopt(curl.get(), CURLOPT_WRITEDATA, out.get());
+    curl_easy_setopt(curl.get(), CURLOPT_ERRORBUFFER, errorText);
+    curl_easy_setopt(curl.get(), CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(curl.get(), CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
+    curl_easy_setopt(curl.get(), CURLOPT_LOW_SPEED_LIMIT, 1L);
+    curl_easy_setopt(curl.get(), CURLOPT_LOW_SPEED_TIME, kLowSpeedSeconds);
+    curl_easy_setopt(curl.get(), CURLOPT_TIMEOUT, kTransferSeconds);
+
+    bool ok = false;
+    const CURLcode rc = curl_easy_perform(curl.get());
+    if (rc != CURLE_OK) {
+        syslog(LOG_ERR, "%s:%d failed to exec curl command (%s)", kModule, __LINE__,
+               errorText[0] ? errorText : curl_easy_strerror(rc));
+    } else {
+        // A failed query of the code leaves 200: the transfer itself succeeded.
+        long code = 200;
+        curl_easy_getinfo(curl.get(), CURLINFO_RESPONSE_CODE, &code);
+        if (code == 200) {
+            ok = true;
+        } else if (code != 404) {
+            // 404 is the ordinary answer when nothing is published for this build and model.
+            syslog(LOG_ERR, "%s:%d Error server %s", kModule, __LINE__, url.c_str());
+            m_errno = 1;
+        }
+    }
+    // A failed close (the disk filled up while the body was written) fails the fetch too.
+    if (out.close() != 0) {
+        ok = false;
+    }
+    if (!ok) {
+        unlink(outPath.c_str());
+    }
+    return ok;
+}
+
+bool SmallUpdate::SetUpdateList(const std::string& path) {
+    if (path.empty()) {
+        syslog(LOG_ERR, "%s:%d bad file name", kModule, __LINE__);
+        return false;
+    }
+    m_buildNumber = -1;
+    m_newSmallFixNumber = -1;
+    m_smallUpdateDeb.clear();
+    m_smallUpdateDebLink.clear();
+    m_flashUpdateDeb.clear();
+    m_flashUpdateDebLink.clear();
+    m_blConfigUpdate = false;
+    m_blFlashUpdate = false;
+    m_blRestartAllService = false;
+    m_blNeedReboot = false;
+    m_installDebLinks.clear();
+    m_installDebs.clear();
+    m_vyxServiceRestartList.clear();
+    m_pkgRestartList.clear();
+
+    Json::Value root;
+    if (UpdateUtil::ParseJsonRootFromFile(path.c_str(), root) != 1) {
+        syslog(LOG_ERR, "%s:%d failed to parse json file %s", kModule, __LINE__, path.c_str());
+        return false;
+    }
+    // A document that is not an object has none of the keys (and jsoncpp's member lookup
+    // would throw on it).
+    if (!root.isObject() || !root.isMember("smallupdate") || !root.isMember("vyxversion") ||
+        !root.isMember("unique")) {
+        syslog(LOG_ERR, "%s:%d lack of smallUpdate/vyxversion/%s in Json", kModule, __LINE__,
+               "unique");
+        return false;
+    }
+    // A "unique" that jsoncpp cannot turn into text (a container) matches no model.
+    const Json::Value& uniqueValue = root["unique"];
+    const std::string listUnique =
+        uniqueValue.isConvertibleTo(Json::stringValue) ? uniqueValue.asString() : std::string();
+    if (!uniqueValue.isConvertibleTo(Json::stringValue) || listUnique != m_unique) {
+        m_errno = 7;
+        syslog(LOG_ERR, "%s:%d unique not match [%s] unique in json[%s]", kModule, __LINE__,
+               m_unique.c_str(), listUnique.c_str());
+        return false;
+    }
+
+    char buf[32] = {0};
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buf, sizeof(buf), 0) < 0) {
+        syslog(LOG_ERR, "%s:%d Get buildnumber Fail[0x%04X %s:%d]", kModule, __LINE__,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return false;
+    }
+    const int runningBuild = static_cast<int>(strtol(buf, nullptr, 10));
+    const int installedFix = InstalledSmallFixNumber();
+
+    const Json::Value& entries = root["smallupdate"];
+    if (!entries.isArray()) {
+        syslog(LOG_ERR, "%s:%d data[%s] is not array", kModule, __LINE__, "smallupdate");
+        return false;
+    }
+    // A "vyxversion" that is not a number (or out of int range) belongs to no build.
+    const Json::Value& versionValue = root["vyxversion"];
+    const bool versionIsInt = versionValue.isConvertibleTo(Json::intValue);
+    const int listBuild = versionIsInt ? versionValue.asInt() : -1;
+    if (!versionIsInt || listBuild != runningBuild) {
+        m_errno = 5;
+        syslog(LOG_ERR, "%s:%d verison not match, original buildnumber[%d], json buildnumber[%d]",
+               kModule, __LINE__, runningBuild, listBuild);
+        return false;
+    }
+
+    CustomBugFix merger(installedFix);
+    for (Json::ArrayIndex i = 0; i < entries.size(); ++i) {
+        if (merger.Merge(entries[i]) != 1) {
+            return false;
+        }
+    }
+
+    m_buildNumber = listBuild;
+    m_smallUpdateDeb = merger.m_smallUpdateDeb;
+    m_smallUpdateDebLink = merger.m_smallUpdateDebLink;
+    m_flashUpdateDeb = merger.m_flashUpdateDeb;
+    m_flashUpdateDebLink = merger.m_flashUpdateDebLink;
+    m_newSmallFixNumber = merger.m_smallFixNumber;
+    m_blConfigUpdate = merger.m_blConfigUpdate;
+    m_blFlashUpdate = merger.m_blFlashUpdate;
+    m_installDebLinks = merger.m_installDebLinks;
+    m_installDebs = merger.m_installDebs;
+    // The strongest restart demand wins: reboot, then restart of all services, then the lists.
+    if (merger.m_blNeedReboot) {
+        m_blNeedReboot = true;
+    } else if (merger.m_blRestartAllService) {
+        m_blRestartAllService = true;
+    } else {
+        m_vyxServiceRestartList = merger.m_vyxServiceRestartList;
+        m_pkgRestartList = merger.m_pkgRestartList;
+    }
+    return true;
+}
+
+bool SmallUpdate::LookUpServer() {
+    const std::string listPath = "/tmp/smallupd@te_" + m_unique + ".json";
+    // The downloaded copy is only read here.
+    kyto::ScopedUnlink removeList(listPath);
+    return DownloadJson(listPath) && SetUpdateList(listPath);
+}
+
+bool SmallUpdate::CheckHaveSmallFix() {
+    m_errno = 0;
+    if (m_newSmallFixNumber < 1) {
+        syslog(LOG_ERR, "%s:%d bad version", kModule, __LINE__);
+        m_errno = 5;
+        return false;
+    }
+    const int installed = InstalledSmallFixNumber();
+    if (m_newSmallFixNumber == installed) {
+        return false;
+    }
+    if (m_newSmallFixNumber < installed) {
+        syslog(LOG_ERR, "%s:%d small fix can't downgrade, org_version[%d], new_version[%d]",
+               kModule, __LINE__, installed, m_newSmallFixNumber);
+        m_errno = 6;
+        return false;
+    }
+    // An old apply result must not show for the new fix.
+    unlink(kyto::kApplyStatusFile);
+    return true;
+}
+
+bool SmallUpdate::HaveNewFix() {
+    if (!LookUpServer()) {
+        return false;
+    }
+    return CheckHaveSmallFix();
+}
+
+bool SmallUpdate::CheckPatchIsSmallUpdate(const std::string& archive, bool& isSmallUpdate) {
+    char command[512] = {0};
+    snprintf(command, sizeof(command), "/bin/tar -tf %s | /bin/grep '%s' | wc -l",
+             archive.c_str(), kPatchListName);
+    kyto::UniqueFile pipe(popen(command, "re"), kyto::UniqueFile::kPopen);
+    if (!pipe) {
+        return false;
+    }
+    char line[256] = {0};
+    if (fgets(line, sizeof(line), pipe.get()) == nullptr) {
+        return false;
+    }
+    isSmallUpdate = strtol(line, nullptr, 10) != 0;
+    return true;
+}
+
+bool SmallUpdate::ImportSmallPatch(const std::string& archive, const std::string& folderName,
+                                   bool blPassive) {
+    if (!KLIBCFileExist(archive.c_str())) {
+        syslog(LOG_ERR, "%s:%d [%s] does not exist!", kModule, __LINE__, archive.c_str());
+        return false;
+    }
+    if (!GetSourceDir(m_debDir, folderName)) {
+        syslog(LOG_ERR, "%s:%d failed to get source dir", kModule, __LINE__);
+        return false;
+    }
+    if (UpdateUtil::CleanFolder(m_debDir) != 1) {
+        return false;
+    }
+    if (UpdateUtil::UntarFile(archive, m_debDir) != 1) {
+        syslog(LOG_ERR, "%s:%d failed to untar file %s", kModule, __LINE__, archive.c_str());
+        return false;
+    }
+    if (!SetUpdateList(m_debDir + "/" + kPatchListName)) {
+        syslog(LOG_ERR, "%s:%d failed to set update list", kModule, __LINE__);
+        return false;
+    }
+    if (!CheckHaveSmallFix()) {
+        syslog(LOG_ERR, "%s:%d check small fix version[%d] error.", kModule, __LINE__,
+               m_newSmallFixNumber);
+        return false;
+    }
+    if (!DumpToInfoFile(blPassive)) {
+        syslog(LOG_ERR, "%s:%d failed to dump info file", kModule, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+bool SmallUpdate::ImportSmallPatch(const std::string& archive) {
+    return ImportSmallPatch(archive, kDefaultDebDirName, false);
+}
+
+std::string SmallUpdate::GetFullVersion() {
+    if (m_newSmallFixNumber < 1) {
+        return std::string();
+    }
+    _tag_vyxinfo_ info;
+    memset(&info, 0, sizeof(info));
+    if (!VyxUpdate::GetVyxInfo(info)) {
+        syslog(LOG_ERR, "%s:%d Fail to get VYX info", kModule, __LINE__);
+        return std::string();
+    }
+    // The display text is cut to 63 characters, as the interface shows it.
+    char text[64] = {0};
+    if (snprintf(text, sizeof(text), "VYX %s.%s-%s update %d", info.major, info.minor,
+                 info.buildNum, m_newSmallFixNumber) < 0) {
+        return std::string();
+    }
+    return text;
+}
