@@ -1,0 +1,222 @@
+// SmallUpdate: downloading a small update.  The packages named by the record are fetched
+// one after another with the system's wget into m_debDir, while the download status file
+// shows the interface's poller how far it got; another process can stop the download with
+// the stop marker.  A finished download is recorded in the info file for the apply.
+#include "smallupdate.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
+
+#include <kytoplatform/klibc.h>
+
+#include "kyto_paths.h"
+#include "scoped.h"
+#include "update_cpputil.h"
+
+namespace {
+
+constexpr const char* kModule = "smallupdate";
+constexpr const char* kWget = "/usr/kyto/bin/wget";
+constexpr const char* kStopMarker = "/tmp/stop_download_smallfix";
+constexpr const char* kDefaultDebDirName = "/@smallupd@te_deb";
+// Each wget run makes one try; the retries are counted here.
+constexpr int kWgetAttempts = 10;
+
+const char* const kDownloadWords[] = {
+    "none", "init", "downloading", "finished", "failed", "stopped",
+};
+
+bool StopRequested() {
+    return KLIBCFileExist(kStopMarker) != 0;
+}
+
+}  // namespace
+
+bool SmallUpdate::ExecWgetP(const std::string& link, const std::string& folder) {
+    if (link.empty() || folder.empty()) {
+        return false;
+    }
+    const size_t slash = link.rfind('/');
+    if (slash == std::string::npos) {
+        syslog(LOG_ERR, "%s:%d Wrong download link [%s]", kModule, __LINE__, link.c_str());
+        return false;
+    }
+    char output[4096] = {0};
+    snprintf(output, sizeof(output), "%s/%s", folder.c_str(), link.c_str() + slash + 1);
+
+    const char* argv[] = {
+        kWget, link.c_str(), "-O", output, "--timeout=15", "--tries=1", "--no-dns-cache", nullptr,
+    };
+    const int r = KLIBCExecv(kWget, const_cast<char* const*>(argv), 1);
+    if (r == 0) {
+        return true;
+    }
+    syslog(LOG_ERR, "%s:%d failed to exec cmd=[%s %s %s %s %s %s], r=%d, %m", kModule, __LINE__,
+           argv[0], argv[1], argv[2], argv[3], argv[4], argv[5], r);
+    // wget has created the output file before it failed: a partial file never stays.
+    if (unlink(output) != 0) {
+        syslog(LOG_ERR, "%s:%d failed to unlink %s[0x%04X %s:%d]", kModule, __LINE__, output,
+               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+    }
+    return false;
+}
+
+bool SmallUpdate::ExecWgetWithRetry(const std::string& link, const std::string& folder) {
+    for (int attempt = 0; attempt < kWgetAttempts; ++attempt) {
+        // A stop request ends the retries; the caller sees the marker and stops.
+        if (StopRequested()) {
+            return true;
+        }
+        if (ExecWgetP(link, folder)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+bool SmallUpdate::DownloadFiles(bool& stopped) {
+    int percentage = 0;
+    std::vector<std::string> links;
+
+    if (m_installDebLinks.empty() && m_smallUpdateDebLink.empty() &&
+        m_flashUpdateDebLink.empty()) {
+        goto FAIL;
+    }
+    unlink(kyto::kDownloadStatusFile);
+    if (!UpdateDownloadProgress(0, DOWNLOAD_STATUS_INIT)) {
+        syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
+        goto FAIL;
+    }
+    // A marker left over from an earlier, already stopped download does not stop this one.
+    if ((StopRequested() && unlink(kStopMarker) != 0) || UpdateUtil::CleanFolder(m_debDir) != 1) {
+        syslog(LOG_ERR, "%s:%d Failed to cleam folder %m", kModule, __LINE__);
+        goto FAIL;
+    }
+
+    // The small-update package is fetched only together with a configuration update or
+    // further packages.
+    links = m_installDebLinks;
+    if (!m_smallUpdateDebLink.empty() && (m_blConfigUpdate || !m_installDebLinks.empty())) {
+        links.push_back(m_smallUpdateDebLink);
+    }
+    if (m_blFlashUpdate && !m_flashUpdateDebLink.empty()) {
+        links.push_back(m_flashUpdateDebLink);
+    }
+
+    for (size_t i = 0; i < links.size(); ++i) {
+        if (StopRequested()) {
+            UpdateUtil::RemoveFolder(m_debDir);
+            unlink(kStopMarker);
+            stopped = true;
+            unlink(kyto::kDownloadStatusFile);
+            return true;
+        }
+        if (!ExecWgetWithRetry(links[i], m_debDir)) {
+            goto FAIL;
+        }
+        percentage = static_cast<int>(100 * (i + 1) / links.size());
+        if (!StopRequested() && !UpdateDownloadProgress(percentage, DOWNLOAD_STATUS_DOWNLOADING)) {
+            syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
+            goto FAIL;
+        }
+    }
+    if (StopRequested()) {
+        // Stopped after the last file: the files and the marker stay.
+        stopped = true;
+    } else if (!UpdateDownloadProgress(100, DOWNLOAD_STATUS_FINISHED)) {
+        syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
+        goto FAIL;
+    }
+    // From here on a finished download is recognised by the info file.
+    unlink(kyto::kDownloadStatusFile);
+    return true;
+
+FAIL:
+    if (!UpdateDownloadProgress(percentage, DOWNLOAD_STATUS_FAILED)) {
+        syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
+    }
+    UpdateUtil::RemoveFolder(m_debDir);
+    return false;
+}
+
+bool SmallUpdate::Download(bool blDump, const std::string& folderName, bool blPassive) {
+    bool stopped = false;
+    // A record that was never filled is looked up first; a filled one is used as it is.
+    if (m_newSmallFixNumber < 0 && !HaveNewFix()) {
+        return false;
+    }
+    if (!GetSourceDir(m_debDir, folderName)) {
+        syslog(LOG_ERR, "%s:%d failed to get source dir", kModule, __LINE__);
+        return false;
+    }
+    if (!DownloadFiles(stopped)) {
+        return false;
+    }
+    if (!stopped && blDump) {
+        return DumpToInfoFile(blPassive);
+    }
+    return true;
+}
+
+bool SmallUpdate::Download(bool blDump) {
+    return Download(blDump, kDefaultDebDirName, false);
+}
+
+void SmallUpdate::GetDownloadStatus(int& percentage, std::string& status) {
+    if (KLIBCFileExist(kyto::kAutoUpdateInfoFile) && ImportInfoFile(kyto::kAutoUpdateInfoFile)) {
+        percentage = 100;
+        status = kDownloadWords[DOWNLOAD_STATUS_FINISHED];
+        return;
+    }
+    if (!KLIBCFileExist(kyto::kDownloadStatusFile)) {
+        status = kDownloadWords[DOWNLOAD_STATUS_NONE];
+        return;
+    }
+    char percentBuf[16] = {0};
+    char statusBuf[16] = {0};
+    if (KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyPercentage, percentBuf,
+                             sizeof(percentBuf), 0) <= 0 ||
+        KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyDownloadStatus, statusBuf,
+                             sizeof(statusBuf), 0) <= 0) {
+        status = kDownloadWords[DOWNLOAD_STATUS_FAILED];
+        return;
+    }
+    percentage = static_cast<int>(strtol(percentBuf, nullptr, 10));
+    const unsigned long state = static_cast<unsigned long>(strtol(statusBuf, nullptr, 10));
+    status = state <= DOWNLOAD_STATUS_STOPPED ? kDownloadWords[state]
+                                              : kDownloadWords[DOWNLOAD_STATUS_FAILED];
+}
+
+bool SmallUpdate::CancelDownload() {
+    kyto::UniqueFd marker(open(kStopMarker, O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+    if (!marker.valid() && !StopRequested()) {
+        syslog(LOG_ERR, "%s:%d failed to create stop status file[0x%04X %s:%d]", kModule,
+               __LINE__, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        return false;
+    }
+    UpdateDownloadProgress(0, DOWNLOAD_STATUS_STOPPED);
+    // The download folder's name stands where a pid file would: the platform answers for
+    // whatever it names.
+    if (KLIBCIsProcAlive(kDefaultDebDirName)) {
+        KLIBCKill(kDefaultDebDirName, 1);
+    }
+    unlink(kyto::kAutoUpdateInfoFile);
+    marker.reset();
+    return true;
+}
+
+bool SmallUpdate::IsReadyApply() {
+    if (m_newSmallFixNumber < 0 && !ImportInfoFile(kyto::kAutoUpdateInfoFile)) {
+        return false;
+    }
+    return FilesExist(m_debDir, m_installDebs) || FilesExist(m_debDir, m_flashUpdateDeb) ||
+           FilesExist(m_debDir, m_smallUpdateDeb);
+}
