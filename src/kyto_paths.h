@@ -1,5 +1,5 @@
-// Fixed paths of the appliance that more than one module uses.  Internal header: not
-// installed.
+// Fixed paths of the appliance and the constants that more than one module uses.
+// Internal header: not installed.
 #ifndef KYTOINSTALLCPP_KYTO_PATHS_H
 #define KYTOINSTALLCPP_KYTO_PATHS_H
 
@@ -13,6 +13,10 @@ constexpr const char* kPassiveInfoFile = "/passive_upd@te.info";
 constexpr const char* kApplyStatusFile = "/var/run/applySmallUpd@te.status";
 constexpr const char* kDpkgLog = "/var/log/dpkg_upgrade.log";
 constexpr const char* kUpdateLog = "/var/log/kytoupdate.log";
+constexpr const char* kWget = "/usr/kyto/bin/wget";
+
+// Free space below which no download place is used by either engine: 200 MiB.
+constexpr unsigned long kMinDownloadFreeBytes = 209715200UL;
 
 // Keys and values of the download status file.
 constexpr const char* kKeyUpdateType = "updateType";

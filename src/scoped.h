@@ -1,98 +1,42 @@
-// Small RAII owners for C resources, so that no early return leaks a descriptor, a
-// FILE*, a pipe or a temporary file.  Internal header: not installed.
+// The library's RAII owners: the set shared with the platform layer (descriptors, FILE*s,
+// temporary files, child waits), plus owners of the platform's own allocations.
+// Internal header: not installed.
 #ifndef KYTOINSTALLCPP_SCOPED_H
 #define KYTOINSTALLCPP_SCOPED_H
 
-#include <errno.h>
-#include <stdio.h>
-#include <sys/types.h>
-#include <sys/wait.h>
-#include <unistd.h>
+#include <stdlib.h>
 
-#include <string>
-#include <utility>
+#include <memory>
+
+#include <kytoplatform/klibc.h>
+#include <kytoplatform/kyto_system.h>
+
+#include "../platform/src/scoped_owners.h"
 
 namespace kyto {
 
-// Owns a file descriptor.
-class UniqueFd {
-  public:
-    UniqueFd() = default;
-    explicit UniqueFd(int fd) : fd_(fd) {}
-    ~UniqueFd() { reset(); }
-    UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
-    UniqueFd& operator=(UniqueFd&& o) noexcept {
-        if (this != &o)
-            reset(o.release());
-        return *this;
-    }
-    UniqueFd(const UniqueFd&) = delete;
-    UniqueFd& operator=(const UniqueFd&) = delete;
-
-    int get() const { return fd_; }
-    bool valid() const { return fd_ >= 0; }
-    int release() { return std::exchange(fd_, -1); }
-    void reset(int fd = -1) {
-        if (fd_ >= 0)
-            ::close(fd_);
-        fd_ = fd;
-    }
-
-  private:
-    int fd_ = -1;
+struct SzListFree {
+    void operator()(PKLIBC_SZLIST list) const { KLIBCSzListFree(list); }
 };
+// Owns a platform string list.
+using UniqueSzList = std::unique_ptr<KLIBC_SZLIST, SzListFree>;
 
-// Owns a FILE* opened with fopen (closed with fclose) or popen (closed with pclose).
-class UniqueFile {
-  public:
-    enum Kind { kFopen, kPopen };
-    UniqueFile() = default;
-    explicit UniqueFile(FILE* f, Kind kind = kFopen) : f_(f), kind_(kind) {}
-    ~UniqueFile() { close(); }
-    UniqueFile(const UniqueFile&) = delete;
-    UniqueFile& operator=(const UniqueFile&) = delete;
-
-    FILE* get() const { return f_; }
-    explicit operator bool() const { return f_ != nullptr; }
-    // Closes now; returns fclose's or pclose's result (-1 when nothing was open).
-    int close() {
-        if (!f_)
-            return -1;
-        FILE* f = std::exchange(f_, nullptr);
-        return kind_ == kPopen ? ::pclose(f) : ::fclose(f);
-    }
-
-  private:
-    FILE* f_ = nullptr;
-    Kind kind_ = kFopen;
+struct MountVolListFree {
+    void operator()(PKYTO_MOUNT_VOL_INFO list) const { KYTOMountVolInfoFree(list); }
 };
+// Owns the platform's list of mounted volumes.
+using UniqueMountVolList = std::unique_ptr<KYTO_MOUNT_VOL_INFO, MountVolListFree>;
 
-// Unlinks a path when it goes out of scope, unless released.
-class ScopedUnlink {
-  public:
-    explicit ScopedUnlink(std::string path) : path_(std::move(path)) {}
-    ~ScopedUnlink() {
-        if (!path_.empty())
-            ::unlink(path_.c_str());
-    }
-    ScopedUnlink(const ScopedUnlink&) = delete;
-    ScopedUnlink& operator=(const ScopedUnlink&) = delete;
-    void release() { path_.clear(); }
-    const std::string& path() const { return path_; }
-
-  private:
-    std::string path_;
+// A getline buffer that is freed on every way out.
+struct LineBuffer {
+    char* data = nullptr;
+    size_t size = 0;
+    LineBuffer() = default;
+    LineBuffer(const LineBuffer&) = delete;
+    LineBuffer& operator=(const LineBuffer&) = delete;
+    ~LineBuffer() { free(data); }
+    ssize_t Read(FILE* f) { return getline(&data, &size, f); }
 };
-
-// Waits for one child, retrying when a signal interrupts the wait.  Returns waitpid's
-// result (the pid, or -1 with errno set).
-inline pid_t WaitForChild(pid_t pid, int* status) {
-    pid_t r;
-    do {
-        r = ::waitpid(pid, status, 0);
-    } while (r < 0 && errno == EINTR);
-    return r;
-}
 
 }  // namespace kyto
 

@@ -21,7 +21,11 @@
 #include <kytoplatform/kyto_errors.h>
 
 #include "debian_lib.h"
+#include "download_status.h"
+#include "file_system.h"
+#include "json_members.h"
 #include "kyto_paths.h"
+#include "platform_error.h"
 #include "scoped.h"
 #include "update_cpputil.h"
 
@@ -48,9 +52,6 @@ constexpr const char* kRmRelative = "bin/rm";
 constexpr const char* kMvRelative = "bin/mv";
 constexpr const char* kMvAbsolute = "/bin/mv";
 
-// Free space a download folder needs: 200 MiB.
-constexpr unsigned long kSourceDirMinFree = 209715200UL;
-
 // Apply status keys.
 constexpr const char* kKeyStage = "stage";
 constexpr const char* kKeyErrMsg = "ErrMsg";
@@ -59,34 +60,6 @@ constexpr const char* kErrSystem = "err_system";
 const char* const kStageWords[] = {
     "none", "waiting_remote_upgrading", "analying", "program", "startService", "finished", "reboot",
 };
-
-// Reads an optional string member with jsoncpp's own conversion (a missing key reads as
-// "", a number as its text); a container, which jsoncpp cannot convert, reads as "".
-std::string OptionalString(const Json::Value& root, const char* key) {
-    const Json::Value& v = root[key];
-    return v.isConvertibleTo(Json::stringValue) ? v.asString() : std::string();
-}
-
-// Reads an optional boolean member with jsoncpp's own conversion (a missing key reads as
-// false, a non-zero number as true); a value jsoncpp cannot convert reads as false.
-bool OptionalBool(const Json::Value& root, const char* key) {
-    const Json::Value& v = root[key];
-    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
-}
-
-// Converts an optional array of strings; a missing key is an empty list.
-bool OptionalStringList(const Json::Value& root, const char* key, std::vector<std::string>& out) {
-    const Json::Value& v = root[key];
-    if (v.isNull()) {
-        out.clear();
-        return true;
-    }
-    return UpdateUtil::JsonArray2StringVector(v, out) == 1;
-}
-
-int RemoveWithRelativeRm(const char* folder) {
-    return KLIBCExec(kRmRelative, "-rf", folder, nullptr, nullptr);
-}
 
 }  // namespace
 
@@ -192,17 +165,17 @@ bool SmallUpdate::ImportInfoFile(const char* path) {
     m_errno = 3;
     m_newSmallFixNumber = info["newSmallFixNumber"].asInt();
     m_debDir = info["debDir"].asString();
-    m_smallUpdateDeb = OptionalString(info, "smallupdateDeb");
-    m_blConfigUpdate = OptionalBool(info, "configUpdate");
-    m_flashUpdateDeb = OptionalString(info, "flashupdateDeb");
+    m_smallUpdateDeb = kyto::MemberText(info, "smallupdateDeb");
+    m_blConfigUpdate = kyto::MemberBool(info, "configUpdate");
+    m_flashUpdateDeb = kyto::MemberText(info, "flashupdateDeb");
     if (!m_flashUpdateDeb.empty()) {
         m_blFlashUpdate = true;
     }
-    m_blNeedReboot = OptionalBool(info, "blNeedReboot");
-    m_blRestartAllService = OptionalBool(info, "blRestartAllService");
+    m_blNeedReboot = kyto::MemberBool(info, "blNeedReboot");
+    m_blRestartAllService = kyto::MemberBool(info, "blRestartAllService");
 
     std::vector<std::string> installDebs;
-    if (!OptionalStringList(info, "installDeb", installDebs)) {
+    if (!kyto::MemberStringList(info, "installDeb", installDebs)) {
         return false;
     }
     for (const std::string& name : installDebs) {
@@ -213,10 +186,10 @@ bool SmallUpdate::ImportInfoFile(const char* path) {
     }
     m_installDebs = installDebs;
 
-    if (!OptionalStringList(info, "vyxServiceRestartList", m_vyxServiceRestartList)) {
+    if (!kyto::MemberStringList(info, "vyxServiceRestartList", m_vyxServiceRestartList)) {
         return false;
     }
-    if (!OptionalStringList(info, "pkgRestartList", m_pkgRestartList)) {
+    if (!kyto::MemberStringList(info, "pkgRestartList", m_pkgRestartList)) {
         return false;
     }
     m_errno = 0;
@@ -251,14 +224,13 @@ bool SmallUpdate::DumpToInfoFile(bool blPassive) {
     bool ok = false;
     std::string target;
     if (m_flashUpdateDeb.empty() && m_smallUpdateDeb.empty() && m_installDebs.empty()) {
-        syslog(LOG_ERR, "%s:%d no flash and smallupdate or others debian file[0x%04X %s:%d]",
-               kModule, __LINE__, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d no flash and smallupdate or others debian file%s",
+               kModule, __LINE__, kyto::LastErrorText().c_str());
         goto END;
     }
     if (m_smallUpdateDeb.empty() != m_smallUpdateDebLink.empty()) {
-        syslog(LOG_ERR, "%s:%d bad smallupdate debian [%s][%s][0x%04X %s:%d]", kModule, __LINE__,
-               m_smallUpdateDeb.c_str(), m_smallUpdateDebLink.c_str(), KLIBCErrGet(),
-               KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d bad smallupdate debian [%s][%s]%s", kModule, __LINE__,
+               m_smallUpdateDeb.c_str(), m_smallUpdateDebLink.c_str(), kyto::LastErrorText().c_str());
         goto END;
     }
     if (!m_smallUpdateDeb.empty()) {
@@ -310,19 +282,11 @@ END:
 }
 
 int SmallUpdate::UpdateDownloadProgress(int percentage, DOWNLOAD_STATUS status) {
-    if (KLIBCFileSetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyUpdateType, kyto::kTypeSmall,
-                             nullptr) < 0) {
-        return 0;
-    }
-    char buf[16] = {0};
-    snprintf(buf, sizeof(buf), "%d", percentage);
-    if (KLIBCFileSetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyPercentage, buf,
-                             kyto::kQuotedLineFormat) < 0) {
-        return 0;
-    }
-    snprintf(buf, sizeof(buf), "%d", static_cast<int>(status));
-    if (KLIBCFileSetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyDownloadStatus, buf,
-                             kyto::kQuotedLineFormat) < 0) {
+    if (kyto::SetDownloadStatusKey(kyto::kKeyUpdateType, kyto::kTypeSmall, nullptr) < 0 ||
+        kyto::SetDownloadStatusNumber(kyto::kKeyPercentage, percentage,
+                                      kyto::kQuotedLineFormat) < 0 ||
+        kyto::SetDownloadStatusNumber(kyto::kKeyDownloadStatus, static_cast<int>(status),
+                                      kyto::kQuotedLineFormat) < 0) {
         return 0;
     }
     return 1;
@@ -428,12 +392,12 @@ bool SmallUpdate::UpdateFlash() const {
         }
         ok = (rc == 0);
         if (chdir(cwd) != 0) {
-            syslog(LOG_ERR, "%s:%d failed to go back to %s[0x%04X %s:%d]", kModule, __LINE__, cwd,
-                   KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+            syslog(LOG_ERR, "%s:%d failed to go back to %s%s", kModule, __LINE__, cwd,
+                   kyto::LastErrorText().c_str());
         }
     }
 END:
-    RemoveWithRelativeRm(kFlashTempFolder);
+    kyto::RemoveFolderWith(kRmRelative, kFlashTempFolder);
     return ok;
 }
 
@@ -458,7 +422,7 @@ bool SmallUpdate::UnpackSmallUpdate() const {
     }
     ok = true;
 END:
-    RemoveWithRelativeRm(kSmallTempFolder);
+    kyto::RemoveFolderWith(kRmRelative, kSmallTempFolder);
     return ok;
 }
 
@@ -506,7 +470,7 @@ bool SmallUpdate::InstallDeb(int startPercentage, APPLY_STAGE stage) {
     // Reboot needed: stage the packages for the next boot instead of installing them.
     struct stat st;
     if (stat(kStagingFolder, &st) != 0 || !S_ISDIR(st.st_mode)) {
-        RemoveWithRelativeRm(kStagingFolder);
+        kyto::RemoveFolderWith(kRmRelative, kStagingFolder);
         if (mkdir(kStagingFolder, 0700) != 0) {
             syslog(LOG_ERR, "%s:%d Failed to mkdir(%s) [%m]", kModule, __LINE__, kStagingFolder);
             UpdateUtil::RemoveFolder(kStagingFolder);
@@ -529,7 +493,7 @@ bool SmallUpdate::InstallDeb(int startPercentage, APPLY_STAGE stage) {
 
 bool SmallUpdate::GetSourceDir(std::string& folder, const std::string& name) {
     std::string volume;
-    if (!UpdateUtil::IsThereAvailVolPath(volume, kSourceDirMinFree, true)) {
+    if (!UpdateUtil::IsThereAvailVolPath(volume, kyto::kMinDownloadFreeBytes, true)) {
         m_errno = 2;
         return false;
     }

@@ -3,19 +3,20 @@
 #include <errno.h>
 #include <string.h>
 #include <sys/stat.h>
-#include <sys/statfs.h>
 #include <sys/types.h>
 #include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <sstream>
 
 #include <kytoplatform/klibc.h>
 #include <kytoplatform/kyto_errors.h>
 #include <kytoplatform/kyto_system.h>
 
+#include "file_system.h"
+#include "json_members.h"
 #include "kyto_paths.h"
+#include "platform_error.h"
 #include "scoped.h"
 
 namespace {
@@ -54,9 +55,9 @@ int UpdateUtil::ParseJsonRootFromFile(const char* path, Json::Value& root) {
         }
         text = ReadAll(file.get());
     }
-    std::istringstream stream(text);
-    Json::Reader reader;
-    if (!reader.parse(stream, root, false)) {
+    // A document the parser gives up on (nested deeper than it allows) is as broken as
+    // one with a syntax error: deleted, so that the next run starts clean.
+    if (!kyto::ParseJsonText(text, root)) {
         syslog(LOG_ERR, "%s:%d Parse failed\n", kModule, __LINE__);
         unlink(path);
         return 0;
@@ -148,12 +149,7 @@ int UpdateUtil::UntarFile(const std::string& archive, const std::string& folder)
 }
 
 int UpdateUtil::RemoveFolder(const char* path) {
-    // Without an operand "rm -rf" would succeed doing nothing.
-    if (!path) {
-        KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, __FILE__, __LINE__);
-        return 0;
-    }
-    return KLIBCExec("/bin/rm", "-rf", path, nullptr, nullptr) == 0 ? 1 : 0;
+    return kyto::RemoveFolderWith("/bin/rm", path);
 }
 
 int UpdateUtil::RemoveFolder(const std::string& path) {
@@ -167,8 +163,8 @@ int UpdateUtil::CleanFolder(const char* path) {
         // mkdir is a C library call: record it as the platform's last error so the message
         // names this failure and not an older one.
         KLIBCErrSetEx(KYTO_ERR_SYSTEM, __FILE__, __LINE__);
-        syslog(LOG_ERR, "%s:%d Fail to mkdir: %s, KytoErr =[0x%04X %s:%d]", kModule, __LINE__, path,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to mkdir: %s, KytoErr =%s", kModule, __LINE__, path,
+               kyto::LastErrorText().c_str());
         return 0;
     }
     return 1;
@@ -184,36 +180,25 @@ int UpdateUtil::IsThereAvailVolPath(std::string& path, unsigned long minFreeByte
     char szPath[4095] = {0};
     bool found = false;
 
-    PKYTO_MOUNT_VOL_INFO node = KYTOMountVolInfoEnum(0);
-    for (; node; node = node->pNext) {
-        if (!node->blWritable) {
-            syslog(LOG_ERR, "%s:%d sad.. %s is not a writable volume.", kModule, __LINE__,
-                   node->szMountPath);
-            continue;
-        }
-        if (node->ullFreeBytes >= minFreeBytes) {
-            const size_t n = strnlen(node->szMountPath, sizeof(szPath) - 1);
-            memcpy(szPath, node->szMountPath, n);
-            szPath[n] = '\0';
-            found = true;
-            break;
-        }
-        syslog(LOG_ERR, "%s:%d %llu < %lu, check next volume.", kModule, __LINE__,
-               static_cast<unsigned long long>(node->ullFreeBytes), minFreeBytes);
+    PKYTO_MOUNT_VOL_INFO node =
+        kyto::FirstVolumeWithRoom(KYTOMountVolInfoEnum(0), minFreeBytes, kModule, false);
+    if (node != nullptr) {
+        const size_t n = strnlen(node->szMountPath, sizeof(szPath) - 1);
+        memcpy(szPath, node->szMountPath, n);
+        szPath[n] = '\0';
+        found = true;
     }
     // Released from the node where the walk stopped; after running off the end there is
     // nothing left to release from.  The callers are short-lived processes.
     KYTOMountVolInfoFree(node);
 
     if (!found && allowRoot) {
-        struct statfs st;
-        if (statfs("/", &st) != 0) {
+        unsigned long long avail = 0;
+        if (kyto::AvailableBytes("/", avail) != 0) {
             syslog(LOG_ERR, "%s:%d sad.. could not get the size of %s. reason=%s.", kModule,
                    __LINE__, "/", strerror(errno));
             return 0;
         }
-        const unsigned long long avail = static_cast<unsigned long long>(st.f_bavail) *
-                                         static_cast<unsigned long long>(st.f_bsize);
         if (avail < minFreeBytes) {
             syslog(LOG_ERR, "%s:%d sad.. %s do not have sufficient size.", kModule, __LINE__, "/");
             return 0;
@@ -262,23 +247,22 @@ int UpdateUtil::GetUserAgent(std::string& agent) {
     char szMinor[16] = {0};
 
     if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "unique", szUnique, sizeof(szUnique), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get unique Fail[0x%04X %s:%d]", kModule, __LINE__, KLIBCErrGet(),
-               KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Get unique Fail%s", kModule, __LINE__, kyto::LastErrorText().c_str());
         return 0;
     }
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", szBuild, sizeof(szBuild), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get buildnumber Fail[0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return 0;
     }
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "majorversion", szMajor, sizeof(szMajor), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get majorversion Fail[0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Get majorversion Fail%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return 0;
     }
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "minorversion", szMinor, sizeof(szMinor), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get minorversion Fail[0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Get minorversion Fail%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return 0;
     }
     char szAgent[512] = {0};

@@ -16,7 +16,6 @@
 #include <string.h>
 #include <strings.h>
 #include <sys/stat.h>
-#include <sys/statfs.h>
 #include <sys/types.h>
 #include <sys/wait.h>
 #include <syslog.h>
@@ -32,7 +31,11 @@
 #include <kytoplatform/kytoconf.h>
 
 #include "child_process.h"
+#include "download_status.h"
+#include "file_system.h"
+#include "json_members.h"
 #include "kyto_paths.h"
+#include "platform_error.h"
 #include "scoped.h"
 #include "update_cpputil.h"
 
@@ -45,7 +48,6 @@ const char* const kPidFile = "/var/run/downloadVYX.pid";
 const char* const kOldPidFile = "/var/run/download_vyx.pid";
 const char* const kProgressLog = "/var/run/downloadprogress";
 const char* const kInstallerProgress = "/tmp/update.progress";
-const char* const kWget = "/usr/kyto/bin/wget";
 const char* const kOpenssl = "/usr/kyto/bin/openssl";
 const char* const kNotifier = "/usr/kyto/bin/kytovyxnotify";
 const char* const kDownloadFolderName = "@autoupdate";
@@ -54,9 +56,7 @@ const char* const kDownloadFolderName = "@autoupdate";
 // server followed by the feed script.
 const char* const kDefaultRssServer = "http://update.kyto.local/autoupdate/genRSS.php";
 
-constexpr unsigned long long kMinFreeSpace = 209715200ULL;         // 200 MiB
 constexpr unsigned long long kSufficientFreeSpace = 524288000ULL;  // 500 MiB
-constexpr unsigned long long kLargeFreeSpace = 4ULL << 30;         // 4 GiB
 constexpr int kMaxDownloadAttempts = 10;
 
 constexpr unsigned int kEventDownloadDone = 0x11B01021;
@@ -115,45 +115,10 @@ void ClearModelFields(_tag_vyxinfo_& info) {
     memset(info.checksum, 0, sizeof(info.checksum));
 }
 
-// Text of a JSON member that should be a string; numbers and booleans are converted,
-// anything else (objects, arrays, null) reads as "".
-std::string JsonText(const Json::Value& value) {
-    if (value.isString() || value.isNumeric() || value.isBool())
-        return value.asString();
-    return std::string();
-}
-
-// Text of one member of an info object.  Read through a const reference so that a missing
-// member is not added to the caller's object, and guarded because jsoncpp throws when a
-// member is looked up on anything but an object or null.
-std::string MemberText(const Json::Value& object, const char* key) {
-    if (!object.isObject())
-        return std::string();
-    return JsonText(object[key]);
-}
-
-// Available bytes of the file system holding path, for unprivileged users.
-unsigned long long AvailableBytes(const struct statfs& st) {
-    return static_cast<unsigned long long>(st.f_bavail) *
-           static_cast<unsigned long long>(st.f_bsize);
-}
-
 void UnlinkIfExists(const char* path) {
     if (KLIBCFileExist(path))
         unlink(path);
 }
-
-// A getline buffer that is freed on every way out.
-struct LineBuffer {
-    char* data = nullptr;
-    size_t size = 0;
-    ~LineBuffer() { free(data); }
-    ssize_t Read(FILE* f) { return getline(&data, &size, f); }
-};
-
-struct MountVolListFree {
-    void operator()(PKYTO_MOUNT_VOL_INFO list) const { KYTOMountVolInfoFree(list); }
-};
 
 struct MntentClose {
     void operator()(FILE* f) const { endmntent(f); }
@@ -208,8 +173,8 @@ int VyxUpdate::GetVyxInfo(_tag_vyxinfo_& info) {
     };
     for (const Source& src : sources) {
         if (KLIBCFileGetKeyValue(src.file, src.key, src.field, src.size, 0) < 1) {
-            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-                   src.key, src.file, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
+                   src.key, src.file, kyto::LastErrorText().c_str());
             return 0;
         }
     }
@@ -312,7 +277,7 @@ int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool&
     bool matched = false;
     _tag_rss_tag_type_ type = RSS_TAG_NONE;
 
-    LineBuffer buffer;
+    kyto::LineBuffer buffer;
     ssize_t len;
     while ((len = buffer.Read(file.get())) != -1) {
         std::string line(buffer.data, static_cast<size_t>(len));
@@ -416,18 +381,16 @@ int VyxUpdate::GetRssFile() {
 
     int ret = KLIBCFileGetKeyValue(kyto::kInfoConfFile, "rss_server", server, sizeof(server), 0);
     if (ret < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               "rss_server", kyto::kInfoConfFile, KLIBCErrGet(), KLIBCErrorGetFile(),
-               KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
+               "rss_server", kyto::kInfoConfFile, kyto::LastErrorText().c_str());
         return 0;
     }
     if (ret == 0)
         snprintf(server, sizeof(server), "%s", kDefaultRssServer);
 
     if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "timezone", timezone, sizeof(timezone), 0) < 1) {
-        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               "timezone", kyto::kInfoConfFile, KLIBCErrGet(), KLIBCErrorGetFile(),
-               KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
+               "timezone", kyto::kInfoConfFile, kyto::LastErrorText().c_str());
         return 0;
     }
 
@@ -445,8 +408,8 @@ int VyxUpdate::GetRssFile() {
     if (command.size() > 4095)
         command.resize(4095);
     if (system(command.c_str()) != 0) {
-        syslog(LOG_ERR, "%s:%d Fail to exec command [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               command.c_str(), KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to exec command [%s]. %s", kModule, __LINE__,
+               command.c_str(), kyto::LastErrorText().c_str());
         return 0;
     }
     return 1;
@@ -536,9 +499,9 @@ int VyxUpdate::CheckVyxRelease() {
     }
     if (have && m_haveNew) {
         char folder[4096];
-        snprintf(folder, sizeof(folder), "%s", MemberText(info, "patchPath").c_str());
+        snprintf(folder, sizeof(folder), "%s", kyto::MemberText(info, "patchPath").c_str());
         std::string dir = dirname(folder);
-        if (ToNumber(MemberText(info, "buildnumber").c_str()) != ToNumber(m_release.buildNum)) {
+        if (ToNumber(kyto::MemberText(info, "buildnumber").c_str()) != ToNumber(m_release.buildNum)) {
             // The recorded image belongs to an outdated release.
             if (!CleanDownloadResult(dir)) {
                 syslog(LOG_ERR, "%s:%d Fail to clean download result", kModule, __LINE__);
@@ -589,11 +552,11 @@ bool VyxUpdate::CheckPatchAndUpdateType(bool& isNewer, Json::Value& info) {
         return false;
     }
     snprintf(candidate.major, sizeof(candidate.major), "%s",
-             MemberText(info, "majorversion").c_str());
+             kyto::MemberText(info, "majorversion").c_str());
     snprintf(candidate.minor, sizeof(candidate.minor), "%s",
-             MemberText(info, "minorversion").c_str());
+             kyto::MemberText(info, "minorversion").c_str());
     snprintf(candidate.buildNum, sizeof(candidate.buildNum), "%s",
-             MemberText(info, "buildnumber").c_str());
+             kyto::MemberText(info, "buildnumber").c_str());
     int newer = hotfixOnly ? IsHotfix(current, candidate) : IsVersionNewer(current, candidate);
     if (newer == 1)
         isNewer = true;
@@ -618,13 +581,12 @@ int VyxUpdate::IsPathSufficient(const char* path, bool& sufficient) {
         KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, kModule, __LINE__);
         return 0;
     }
-    struct statfs st;
-    if (statfs(path, &st) != 0) {
+    unsigned long long avail = 0;
+    if (kyto::AvailableBytes(path, avail) != 0) {
         syslog(LOG_ERR, "%s:%d Fail to do statfs to [%s]. reason: [%m]", kModule, __LINE__, path);
         return 0;
     }
-    unsigned long long avail = AvailableBytes(st);
-    if (avail < kMinFreeSpace) {
+    if (avail < kyto::kMinDownloadFreeBytes) {
         syslog(LOG_ERR, "%s:%d Theres is no sufficient free space on [%s]", kModule, __LINE__,
                path);
         return 0;
@@ -636,10 +598,10 @@ int VyxUpdate::IsPathSufficient(const char* path, bool& sufficient) {
 int VyxUpdate::FindDownloadVolume(std::string& path) {
     KYTO_VOLUME_INFO volume;
     memset(&volume, 0, sizeof(volume));
-    int ret = VolumeAvailGet(0, kMinFreeSpace, &volume, 1);
+    int ret = VolumeAvailGet(0, kyto::kMinDownloadFreeBytes, &volume, 1);
     if (ret < 0) {
         syslog(LOG_ERR, "%s:%d Fail to get available volume with size greater than [%llu] bytes",
-               kModule, __LINE__, kMinFreeSpace);
+               kModule, __LINE__, static_cast<unsigned long long>(kyto::kMinDownloadFreeBytes));
         return false;
     }
     if (ret > 0) {
@@ -647,13 +609,13 @@ int VyxUpdate::FindDownloadVolume(std::string& path) {
         return true;
     }
     // No data volume qualifies: the root file system is the last resort.
-    struct statfs st;
-    if (statfs("/", &st) != 0) {
+    unsigned long long rootAvail = 0;
+    if (kyto::AvailableBytes("/", rootAvail) != 0) {
         syslog(LOG_ERR, "%s:%d Fail to do statfs to [%s]. reason=%s", kModule, __LINE__, "/",
                strerror(errno));
         return false;
     }
-    if (AvailableBytes(st) < kMinFreeSpace)
+    if (rootAvail < kyto::kMinDownloadFreeBytes)
         return false;
     path = "/";
     return true;
@@ -672,8 +634,8 @@ int VyxUpdate::PrepareDownloadEnv(std::string& folder) {
         return 0;
     }
     if (KYTOFSMkdirP(folder.c_str(), 0700) < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to mkdir [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               folder.c_str(), KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to mkdir [%s]. %s", kModule, __LINE__,
+               folder.c_str(), kyto::LastErrorText().c_str());
         return 0;
     }
     return 1;
@@ -698,27 +660,14 @@ int VyxUpdate::GetVolumePathForPatch(std::string& path, bool& sufficient) {
         (void)rc;
         chosen = "/";
     } else if (strcasecmp(maxDisks.c_str(), "0") != 0) {
-        std::unique_ptr<KYTO_MOUNT_VOL_INFO, MountVolListFree> list(KYTOMountVolInfoEnum(0));
-        for (PKYTO_MOUNT_VOL_INFO vol = list.get(); vol != nullptr; vol = vol->pNext) {
-            syslog(LOG_ERR, "%s:%d Got a volume %s.", kModule, __LINE__, vol->szMountPath);
-            if (!vol->blWritable) {
-                syslog(LOG_ERR, "%s:%d sad.. %s is not a writable volume.", kModule, __LINE__,
-                       vol->szMountPath);
-                continue;
-            }
-            syslog(LOG_ERR, "%s:%d check if it has sufficient capacity.", kModule, __LINE__);
-            if (vol->ullFreeBytes >= kLargeFreeSpace) {
-                sufficient = true;
-                chosen = vol->szMountPath;
-                break;
-            }
-            if (vol->ullFreeBytes >= kMinFreeSpace) {
-                sufficient = vol->ullFreeBytes > kSufficientFreeSpace;
-                chosen = vol->szMountPath;
-                break;
-            }
-            syslog(LOG_ERR, "%s:%d %llu < %lu, check next volume.", kModule, __LINE__,
-                   vol->ullFreeBytes, static_cast<unsigned long>(kMinFreeSpace));
+        kyto::UniqueMountVolList list(KYTOMountVolInfoEnum(0));
+        PKYTO_MOUNT_VOL_INFO vol =
+            kyto::FirstVolumeWithRoom(list.get(), kyto::kMinDownloadFreeBytes, kModule, true);
+        if (vol != nullptr) {
+            // 4 GiB or more is always sufficient; being above the comfortable free space
+            // already says so.
+            sufficient = vol->ullFreeBytes > kSufficientFreeSpace;
+            chosen = vol->szMountPath;
         }
         if (chosen.empty())
             return 0;
@@ -768,7 +717,7 @@ bool VyxUpdate::GetDownloadedPatchPath(bool& have, std::string& path) {
         return false;
     }
     if (have)
-        path = MemberText(info, "patchPath");
+        path = kyto::MemberText(info, "patchPath");
     return true;
 }
 
@@ -782,10 +731,10 @@ bool VyxUpdate::ExecWgetP(std::string outputPath, std::string url, bool& cancell
     // pollers), its standard output is discarded.  When the log cannot be opened wget
     // keeps this process's standard error.
     kyto::UniqueFd progress(open(kProgressLog, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
-    const char* argv[] = {kWget,          "-O",        outputPath.c_str(), url.c_str(),
+    const char* argv[] = {kyto::kWget,          "-O",        outputPath.c_str(), url.c_str(),
                           "--timeout=15", "--tries=1", "--no-dns-cache",   nullptr};
     kyto::ChildSetup setup;
-    setup.program = kWget;
+    setup.program = kyto::kWget;
     setup.argv = const_cast<char* const*>(argv);
     setup.stdoutFd = kyto::kChildDevNull;
     setup.stderrFd = progress.valid() ? progress.get() : kyto::kChildInherit;
@@ -889,8 +838,8 @@ void VyxUpdate::UpdateVyx(const char*, const char*, bool) {}
 bool VyxUpdate::SetStatusKey(const char* key, const char* value) {
     if (UpdateProgressFile(key, value))
         return true;
-    syslog(LOG_ERR, "%s:%d Fail to update progress file. [0x%04X %s:%d]", kModule, __LINE__,
-           KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+    syslog(LOG_ERR, "%s:%d Fail to update progress file. %s", kModule, __LINE__,
+           kyto::LastErrorText().c_str());
     return false;
 }
 
@@ -974,7 +923,7 @@ int VyxUpdate::DownloadVyx() {
     int result = DownloadImages(record, cancelled);
 
     if (!cancelled)
-        SendNotification(result == 1, JsonText(record.get("patchPath", "")));
+        SendNotification(result == 1, kyto::MemberText(record, "patchPath"));
     if (result == 0) {
         SetStatusKey(kyto::kKeyDownloadStatus, "failed");
     } else {
@@ -994,36 +943,27 @@ bool VyxUpdate::UpdateProgressFile(const char* key, const char* value) {
         KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, kModule, __LINE__);
         return false;
     }
-    if (KLIBCFileSetKeyValue(kyto::kDownloadStatusFile, key, value, nullptr) < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to set [%s] = [%s] to [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               key, value, kyto::kDownloadStatusFile, KLIBCErrGet(), KLIBCErrorGetFile(),
-               KLIBCErrorGetLine());
+    if (kyto::SetDownloadStatusKey(key, value, nullptr) < 0) {
+        syslog(LOG_ERR, "%s:%d Fail to set [%s] = [%s] to [%s]. %s", kModule, __LINE__,
+               key, value, kyto::kDownloadStatusFile, kyto::LastErrorText().c_str());
         return false;
     }
     return true;
 }
 
-bool VyxUpdate::GetDownloadPercentage(const char* patchPath, int& percentage) {
-    struct ListOwner {
-        PKLIBC_SZLIST list;
-        ~ListOwner() { KLIBCSzListFree(list); }
-    } pieces{KLIBCSzListAlloc(512)};
-    if (pieces.list == nullptr) {
-        syslog(LOG_ERR, "%s:%d Fail to alloc list. [0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
-        return false;
-    }
+namespace {
+
+// The total wget announced in its progress log, as it printed it ("Length: 1,234,567
+// (1.2M) [type]" gives "1,234,567"); empty when no line names it.  False (logged) when
+// the log cannot be opened or the line cannot be read.
+bool ReadAnnouncedLength(char (&sizeText)[128]) {
     kyto::UniqueFile file(fopen(kProgressLog, "re"));
     if (!file) {
         syslog(LOG_ERR, "%s:%d Fail to open file [%s] for reading", kModule, __LINE__,
                kProgressLog);
         return false;
     }
-
-    // wget prints the total as "Length: 1,234,567 (1.2M) [type]".
-    char sizeText[128];
-    memset(sizeText, 0, sizeof(sizeText));
-    LineBuffer buffer;
+    kyto::LineBuffer buffer;
     while (buffer.Read(file.get()) != -1) {
         if (strstr(buffer.data, "Length") == nullptr)
             continue;
@@ -1033,10 +973,20 @@ bool VyxUpdate::GetDownloadPercentage(const char* patchPath, int& percentage) {
         }
         break;
     }
+    return true;
+}
 
-    if (KLIBCStrSep(sizeText, ",", &pieces.list) < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to do KLIBCStrSep. [0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+// The announced total as a number: the thousands separators dropped through the
+// platform's string list, the digits converted with automatic base.  False (logged) when
+// a platform call fails.
+bool AnnouncedLengthToNumber(const char* sizeText, kyto::UniqueSzList& pieces,
+                             unsigned long long& total) {
+    PKLIBC_SZLIST list = pieces.release();
+    int split = KLIBCStrSep(sizeText, ",", &list);  // may move the list
+    pieces.reset(list);
+    if (split < 0) {
+        syslog(LOG_ERR, "%s:%d Fail to do KLIBCStrSep. %s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return false;
     }
     int digitsSize = 64;
@@ -1046,16 +996,31 @@ bool VyxUpdate::GetDownloadPercentage(const char* patchPath, int& percentage) {
         return false;
     }
     digits[0] = '\0';
+    int joined = KLIBCSzListJoin(pieces.get(), "", &digits, &digitsSize);  // may move digits
     std::unique_ptr<char, decltype(&free)> digitsOwner(digits, &free);
-    int joined = KLIBCSzListJoin(pieces.list, "", &digits, &digitsSize);
-    digitsOwner.release();
-    digitsOwner.reset(digits);  // the join may have moved the buffer
     if (joined < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to do KLIBCSzListJoin. [0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to do KLIBCSzListJoin. %s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return false;
     }
-    unsigned long long total = strtoull(digits, nullptr, 0);
+    total = strtoull(digits, nullptr, 0);
+    return true;
+}
+
+}  // namespace
+
+bool VyxUpdate::GetDownloadPercentage(const char* patchPath, int& percentage) {
+    kyto::UniqueSzList pieces(KLIBCSzListAlloc(512));
+    if (!pieces) {
+        syslog(LOG_ERR, "%s:%d Fail to alloc list. %s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
+        return false;
+    }
+    char sizeText[128];
+    memset(sizeText, 0, sizeof(sizeText));
+    unsigned long long total = 0;
+    if (!ReadAnnouncedLength(sizeText) || !AnnouncedLengthToNumber(sizeText, pieces, total))
+        return false;
 
     struct stat st;
     if (patchPath == nullptr || stat(patchPath, &st) != 0) {
@@ -1071,62 +1036,46 @@ bool VyxUpdate::GetDownloadPercentage(const char* patchPath, int& percentage) {
     } else if (downloaded == total) {
         percentage = 100;
     } else {
-        percentage = static_cast<int>(
-            floor(static_cast<double>(downloaded) / static_cast<double>(total) * 100.0));
+        percentage = kyto::PercentageToInt(static_cast<double>(downloaded) /
+                                           static_cast<double>(total) * 100.0);
     }
     return true;
 }
 
-bool VyxUpdate::GetDownloadStatus(int& percentage, VYX_DOWNLOAD_STATUS& status) {
-    percentage = 0;
-    status = VYX_DOWNLOAD_STATUS_NONE;
-
+bool VyxUpdate::FinishedDownloadOnRecord(bool& finished) {
+    finished = false;
     bool have = false;
     Json::Value info;
     if (!GetAutoUpdateInfo(have, info)) {
         syslog(LOG_ERR, "%s:%d Fail to get downloaded patch info", kModule, __LINE__);
         return false;
     }
-    if (have) {
-        bool isNewer = false;
-        if (!CheckPatchAndUpdateType(isNewer, info)) {
-            syslog(LOG_ERR,
-                   "%s:%d Fail to check if downloaded patch matches to current update type",
-                   kModule, __LINE__);
-            return false;
-        }
-        if (isNewer) {
-            percentage = 100;
-            status = VYX_DOWNLOAD_STATUS_FINISHED;
-            return true;
-        }
-    }
-    if (!KLIBCFileExist(kyto::kDownloadStatusFile))
+    if (!have)
         return true;
+    if (!CheckPatchAndUpdateType(finished, info)) {
+        syslog(LOG_ERR, "%s:%d Fail to check if downloaded patch matches to current update type",
+               kModule, __LINE__);
+        return false;
+    }
+    return true;
+}
 
+int VyxUpdate::ReadStatusFileKeys(StatusFileKeys& keys) {
     const char* file = kyto::kDownloadStatusFile;
     char updateType[64];
     memset(updateType, 0, sizeof(updateType));
     int ret = KLIBCFileGetKeyValue(file, kyto::kKeyUpdateType, updateType, sizeof(updateType), 0);
     if (ret < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               kyto::kKeyUpdateType, file, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
-        return false;
+        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
+               kyto::kKeyUpdateType, file, kyto::LastErrorText().c_str());
+        return -1;
     }
     // No type, or a small update's file: no full-release download.
     if (ret == 0 || strcmp(updateType, kyto::kTypeVyx) != 0)
-        return true;
+        return 0;
 
-    char patchPath[4096];
-    char downloadStatus[64];
-    char downloadCount[64];
-    char downloadNum[64];
-    memset(patchPath, 0, sizeof(patchPath));
-    memset(downloadStatus, 0, sizeof(downloadStatus));
-    memset(downloadCount, 0, sizeof(downloadCount));
-    memset(downloadNum, 0, sizeof(downloadNum));
-    // The key named in the message of the last two is the one before it; the messages
-    // are kept as they have always been.
+    // Log readers know the messages for a missing "downloadCount" and "downloadNum" by the
+    // key named before each of them.
     struct KeyRead {
         const char* key;
         const char* reported;
@@ -1134,30 +1083,26 @@ bool VyxUpdate::GetDownloadStatus(int& percentage, VYX_DOWNLOAD_STATUS& status) 
         int size;
     };
     const KeyRead reads[] = {
-        {kyto::kKeyPatchPath, kyto::kKeyPatchPath, patchPath, sizeof(patchPath)},
-        {kyto::kKeyDownloadStatus, kyto::kKeyDownloadStatus, downloadStatus,
-         sizeof(downloadStatus)},
-        {kyto::kKeyDownloadCount, kyto::kKeyPatchPath, downloadCount, sizeof(downloadCount)},
-        {kyto::kKeyDownloadNum, kyto::kKeyDownloadStatus, downloadNum, sizeof(downloadNum)},
+        {kyto::kKeyPatchPath, kyto::kKeyPatchPath, keys.patchPath, sizeof(keys.patchPath)},
+        {kyto::kKeyDownloadStatus, kyto::kKeyDownloadStatus, keys.downloadStatus,
+         sizeof(keys.downloadStatus)},
+        {kyto::kKeyDownloadCount, kyto::kKeyPatchPath, keys.downloadCount,
+         sizeof(keys.downloadCount)},
+        {kyto::kKeyDownloadNum, kyto::kKeyDownloadStatus, keys.downloadNum,
+         sizeof(keys.downloadNum)},
     };
     for (const KeyRead& r : reads) {
         if (KLIBCFileGetKeyValue(file, r.key, r.buf, r.size, 0) < 1) {
-            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-                   r.reported, file, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
-            return false;
+            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
+                   r.reported, file, kyto::LastErrorText().c_str());
+            return -1;
         }
     }
+    return 1;
+}
 
-    if (strcmp(downloadStatus, "stopped") == 0) {
-        status = VYX_DOWNLOAD_STATUS_STOPPED;
-        return true;
-    }
-    if (strcmp(downloadStatus, "failed") == 0 ||
-        (strcmp(downloadStatus, "downloading") == 0 && !KLIBCFileExist(kPidFile))) {
-        status = VYX_DOWNLOAD_STATUS_FAILED;
-        return true;
-    }
-
+bool VyxUpdate::RunningDownloadStatus(const StatusFileKeys& keys, int& percentage,
+                                      VYX_DOWNLOAD_STATUS& status) {
     int pid = KLIBCReadPidFile(kPidFile);
     if (pid < 0) {
         syslog(LOG_ERR, "%s:%d [%s] dose not exist", kModule, __LINE__, kPidFile);
@@ -1174,16 +1119,47 @@ bool VyxUpdate::GetDownloadStatus(int& percentage, VYX_DOWNLOAD_STATUS& status) 
     }
     status = VYX_DOWNLOAD_STATUS_DOWNLOADING;
     int current = 0;
-    if (!GetDownloadPercentage(patchPath, current)) {
+    if (!GetDownloadPercentage(keys.patchPath, current)) {
         syslog(LOG_ERR, "%s:%d Fail to get download percentag", kModule, __LINE__);
         return false;
     }
     // Image num of count: the finished images count whole, the current one in part.
-    double count = static_cast<double>(ToNumber(downloadCount));
-    double num = static_cast<double>(ToNumber(downloadNum));
-    double overall = floor((num - 1) * (100.0 / count) + current / count);
-    percentage = std::isfinite(overall) ? static_cast<int>(overall) : 0;
+    double count = static_cast<double>(ToNumber(keys.downloadCount));
+    double num = static_cast<double>(ToNumber(keys.downloadNum));
+    percentage = kyto::PercentageToInt((num - 1) * (100.0 / count) + current / count);
     return true;
+}
+
+bool VyxUpdate::GetDownloadStatus(int& percentage, VYX_DOWNLOAD_STATUS& status) {
+    percentage = 0;
+    status = VYX_DOWNLOAD_STATUS_NONE;
+
+    bool finished = false;
+    if (!FinishedDownloadOnRecord(finished))
+        return false;
+    if (finished) {
+        percentage = 100;
+        status = VYX_DOWNLOAD_STATUS_FINISHED;
+        return true;
+    }
+    if (!KLIBCFileExist(kyto::kDownloadStatusFile))
+        return true;
+
+    StatusFileKeys keys;
+    int read = ReadStatusFileKeys(keys);
+    if (read <= 0)
+        return read == 0;
+
+    if (strcmp(keys.downloadStatus, "stopped") == 0) {
+        status = VYX_DOWNLOAD_STATUS_STOPPED;
+        return true;
+    }
+    if (strcmp(keys.downloadStatus, "failed") == 0 ||
+        (strcmp(keys.downloadStatus, "downloading") == 0 && !KLIBCFileExist(kPidFile))) {
+        status = VYX_DOWNLOAD_STATUS_FAILED;
+        return true;
+    }
+    return RunningDownloadStatus(keys, percentage, status);
 }
 
 std::string VyxUpdate::DownloadStatusToString(VYX_DOWNLOAD_STATUS& status) {
@@ -1218,8 +1194,8 @@ bool VyxUpdate::CancelDownloadVyx() {
     }
     unlink(kPidFile);
     if (!UpdateProgressFile(kyto::kKeyDownloadStatus, "stopped")) {
-        syslog(LOG_ERR, "%s:%d Fail to update progress file. [0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to update progress file. %s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return false;
     }
     return true;
@@ -1245,9 +1221,9 @@ bool VyxUpdate::CleanDownloadResult(std::string path) {
                        path.c_str());
                 return false;
             }
-            if (KLIBCExec("/bin/rm", "-rf", path.c_str(), nullptr, nullptr) != 0) {
-                syslog(LOG_ERR, "%s:%d Fail to remove folder %s. [0x%04X %s:%d]", kModule, __LINE__,
-                       path.c_str(), KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+            if (!UpdateUtil::RemoveFolder(path)) {
+                syslog(LOG_ERR, "%s:%d Fail to remove folder %s. %s", kModule, __LINE__,
+                       path.c_str(), kyto::LastErrorText().c_str());
                 return false;
             }
         }

@@ -133,6 +133,23 @@ class KYTO_EXPORT VyxUpdate {
     _tag_vyxinfo_ m_partnerRelease;
 
   private:
+    // The download keys of the status file, as read by the status reader.
+    struct StatusFileKeys {
+        char patchPath[4096] = {0};
+        char downloadStatus[64] = {0};
+        char downloadCount[64] = {0};
+        char downloadNum[64] = {0};
+    };
+    // Steps of GetDownloadStatus.  Whether "/autoupd@te.info" records a finished download
+    // newer than the running system; false (logged) when that cannot be told.
+    static bool FinishedDownloadOnRecord(bool& finished);
+    // 1 the status file describes a full-release download (keys read), 0 it does not, -1
+    // a key could not be read (logged).
+    static int ReadStatusFileKeys(StatusFileKeys& keys);
+    // Status of a download the status file does not call stopped or failed: the process
+    // in the pid file decides, and the progress log gives the percentage.
+    static bool RunningDownloadStatus(const StatusFileKeys& keys, int& percentage,
+                                      VYX_DOWNLOAD_STATUS& status);
     // Steps 1-9 of DownloadVyx; the caller runs the end steps.  Fills the result record.
     int DownloadImages(Json::Value& record, bool& cancelled);
     // Fetches and verifies one image of the download (number 1: this device's, 2: the

@@ -1,5 +1,4 @@
-// Internal helpers of the platform layer: error reporting, RAII owners for descriptors
-// and files, the key=value file parser and the process runner.  Not installed.
+// Internal helpers of the platform layer: error reporting, the key=value file parser and the process runner.  Not installed.
 #ifndef KYTOPLATFORM_PLATFORM_INTERNAL_H
 #define KYTOPLATFORM_PLATFORM_INTERNAL_H
 
@@ -14,6 +13,8 @@
 #include <kytoplatform/klibc.h>
 #include <kytoplatform/kyto_errors.h>
 
+#include "scoped_owners.h"
+
 // Records code as the thread's last error, with the file and line of the failure site.
 #define KYTO_FAIL(code) KLIBCErrSetEx((code), __FILE__, __LINE__)
 
@@ -21,67 +22,12 @@
 #pragma GCC visibility push(hidden)
 namespace kytoplat {
 
-// Owns a file descriptor.
-class UniqueFd {
-  public:
-    UniqueFd() = default;
-    explicit UniqueFd(int fd) : fd_(fd) {}
-    ~UniqueFd() { reset(); }
-    UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
-    UniqueFd& operator=(UniqueFd&& o) noexcept {
-        if (this != &o)
-            reset(o.release());
-        return *this;
-    }
-    UniqueFd(const UniqueFd&) = delete;
-    UniqueFd& operator=(const UniqueFd&) = delete;
-
-    int get() const { return fd_; }
-    bool valid() const { return fd_ >= 0; }
-    int release() { return std::exchange(fd_, -1); }
-    void reset(int fd = -1) {
-        if (fd_ >= 0)
-            ::close(fd_);
-        fd_ = fd;
-    }
-
-  private:
-    int fd_ = -1;
-};
-
-// Owns a FILE* from fopen/fdopen.
-class UniqueFile {
-  public:
-    explicit UniqueFile(FILE* f = nullptr) : f_(f) {}
-    ~UniqueFile() {
-        if (f_)
-            ::fclose(f_);
-    }
-    UniqueFile(const UniqueFile&) = delete;
-    UniqueFile& operator=(const UniqueFile&) = delete;
-
-    FILE* get() const { return f_; }
-    explicit operator bool() const { return f_ != nullptr; }
-
-  private:
-    FILE* f_ = nullptr;
-};
-
-// Unlinks a path when it goes out of scope, unless released.
-class ScopedUnlink {
-  public:
-    explicit ScopedUnlink(std::string path) : path_(std::move(path)) {}
-    ~ScopedUnlink() {
-        if (!path_.empty())
-            ::unlink(path_.c_str());
-    }
-    ScopedUnlink(const ScopedUnlink&) = delete;
-    ScopedUnlink& operator=(const ScopedUnlink&) = delete;
-    void release() { path_.clear(); }
-
-  private:
-    std::string path_;
-};
+// The RAII owners and EINTR-retrying waits shared with the library.
+using kyto::ReadRetry;
+using kyto::ScopedUnlink;
+using kyto::UniqueFd;
+using kyto::UniqueFile;
+using kyto::WaitForChild;
 
 // Snapshot of the thread's last error, put back when the keeper goes out of scope unless
 // dismissed.  Used by calls that try something whose failure is not their own failure
@@ -105,15 +51,6 @@ class ErrorKeeper {
 // the way) is KYTO_ERR_FILE_NOT_FOUND, anything else `otherwise`.
 inline int OpenErrorCode(int err, int otherwise) {
     return err == ENOENT || err == ENOTDIR ? KYTO_ERR_FILE_NOT_FOUND : otherwise;
-}
-
-// read(2) that retries when a signal interrupts it.
-inline ssize_t ReadRetry(int fd, void* buf, size_t size) {
-    ssize_t n;
-    do {
-        n = ::read(fd, buf, size);
-    } while (n < 0 && errno == EINTR);
-    return n;
 }
 
 // Opens an existing file that is not a folder for reading (O_CLOEXEC).  Returns an

@@ -109,10 +109,7 @@ int SpawnProgram(const char* prog, char* const argv[], pid_t* pid, bool* execFai
 
 int WaitProgram(pid_t pid) {
     int status = 0;
-    pid_t r;
-    do {
-        r = ::waitpid(pid, &status, 0);
-    } while (r < 0 && errno == EINTR);
+    pid_t r = WaitForChild(pid, &status);
     if (r < 0 || !WIFEXITED(status)) {
         KYTO_FAIL(KYTO_ERR_EXEC);
         return -1;

@@ -1,0 +1,114 @@
+// RAII owners for C resources, shared by the platform layer and the library (which
+// includes this header through src/scoped.h), so that no early return leaks a descriptor,
+// a FILE*, a pipe or a temporary file, and no child is left unreaped.  Header only and
+// free of any platform or library call: the platform layer must not depend on the
+// library.  Internal: not installed.
+#ifndef KYTO_SCOPED_OWNERS_H
+#define KYTO_SCOPED_OWNERS_H
+
+#include <errno.h>
+#include <stdio.h>
+#include <sys/types.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <string>
+#include <utility>
+
+// Each shared object keeps its own copy; none of these is part of an exported interface.
+#pragma GCC visibility push(hidden)
+namespace kyto {
+
+// Owns a file descriptor.
+class UniqueFd {
+  public:
+    UniqueFd() = default;
+    explicit UniqueFd(int fd) : fd_(fd) {}
+    ~UniqueFd() { reset(); }
+    UniqueFd(UniqueFd&& o) noexcept : fd_(o.release()) {}
+    UniqueFd& operator=(UniqueFd&& o) noexcept {
+        if (this != &o)
+            reset(o.release());
+        return *this;
+    }
+    UniqueFd(const UniqueFd&) = delete;
+    UniqueFd& operator=(const UniqueFd&) = delete;
+
+    int get() const { return fd_; }
+    bool valid() const { return fd_ >= 0; }
+    int release() { return std::exchange(fd_, -1); }
+    void reset(int fd = -1) {
+        if (fd_ >= 0)
+            ::close(fd_);
+        fd_ = fd;
+    }
+
+  private:
+    int fd_ = -1;
+};
+
+// Owns a FILE* opened with fopen/fdopen (closed with fclose) or popen (closed with pclose).
+class UniqueFile {
+  public:
+    enum Kind { kFopen, kPopen };
+    UniqueFile() = default;
+    explicit UniqueFile(FILE* f, Kind kind = kFopen) : f_(f), kind_(kind) {}
+    ~UniqueFile() { close(); }
+    UniqueFile(const UniqueFile&) = delete;
+    UniqueFile& operator=(const UniqueFile&) = delete;
+
+    FILE* get() const { return f_; }
+    explicit operator bool() const { return f_ != nullptr; }
+    // Closes now; returns fclose's or pclose's result (-1 when nothing was open).
+    int close() {
+        if (!f_)
+            return -1;
+        FILE* f = std::exchange(f_, nullptr);
+        return kind_ == kPopen ? ::pclose(f) : ::fclose(f);
+    }
+
+  private:
+    FILE* f_ = nullptr;
+    Kind kind_ = kFopen;
+};
+
+// Unlinks a path when it goes out of scope, unless released.
+class ScopedUnlink {
+  public:
+    explicit ScopedUnlink(std::string path) : path_(std::move(path)) {}
+    ~ScopedUnlink() {
+        if (!path_.empty())
+            ::unlink(path_.c_str());
+    }
+    ScopedUnlink(const ScopedUnlink&) = delete;
+    ScopedUnlink& operator=(const ScopedUnlink&) = delete;
+    void release() { path_.clear(); }
+    const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+// Waits for one child, retrying when a signal interrupts the wait.  Returns waitpid's
+// result (the pid, or -1 with errno set).
+inline pid_t WaitForChild(pid_t pid, int* status) {
+    pid_t r;
+    do {
+        r = ::waitpid(pid, status, 0);
+    } while (r < 0 && errno == EINTR);
+    return r;
+}
+
+// read(2) that retries when a signal interrupts it.
+inline ssize_t ReadRetry(int fd, void* buf, size_t size) {
+    ssize_t n;
+    do {
+        n = ::read(fd, buf, size);
+    } while (n < 0 && errno == EINTR);
+    return n;
+}
+
+}  // namespace kyto
+#pragma GCC visibility pop
+
+#endif
