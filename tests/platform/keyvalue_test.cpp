@@ -3,30 +3,16 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <string>
-#include <vector>
-
-#include <gtest/gtest.h>
 #include <kytoplatform/kytoplatform.h>
 
 #include "sandbox.h"
 
 namespace {
 
-using kytotest::ListDir;
-using kytotest::ReadFile;
-using kytotest::WriteFile;
+using namespace kytotest;
 using Names = std::vector<std::string>;
-
 constexpr const char* kFile = "/tmp/kv/test.conf";
-
-class KeyValueTest : public kytotest::SandboxTest {};
-
-mode_t ModeOf(const char* path) {
-    struct stat st {};
-    EXPECT_EQ(stat(path, &st), 0) << path;
-    return st.st_mode & 07777;
-}
+using KeyValueTest = SandboxTest;
 
 TEST_F(KeyValueTest, ReadsBothLineFormsIntoBoundedBuffers) {
     WriteFile(kFile,
@@ -71,7 +57,7 @@ TEST_F(KeyValueTest, BadArgumentsAndUnreadableFilesLeaveTheBufferAlone) {
     for (const Case& c : cases) {
         SCOPED_TRACE(std::string(c.path ? c.path : "(null)") + " size " + std::to_string(c.size));
         strcpy(buf, "untouched");
-        KLIBCErrSetEx(0, "", 0);
+        ClearLastError();
         EXPECT_EQ(KLIBCFileGetKeyValue(c.path, c.key, c.buf, c.size, c.flags), -1);
         EXPECT_EQ(KLIBCErrGet(), c.err);
         EXPECT_STREQ(buf, "untouched");
@@ -126,7 +112,7 @@ TEST_F(KeyValueTest, SetRejectsBadArgumentsAndFormats) {
     for (const Case& c : cases) {
         SCOPED_TRACE(std::string(c.key ? c.key : "(null)") + " / " +
                      (c.format ? c.format : "(null)"));
-        KLIBCErrSetEx(0, "", 0);
+        ClearLastError();
         EXPECT_EQ(KLIBCFileSetKeyValue(c.path, c.key, c.value, c.format), -1);
         EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
     }
@@ -137,7 +123,7 @@ TEST_F(KeyValueTest, ReaderInAnotherProcessNeverSeesATornOrMissingFile) {
     const std::string shortValue = "s";
     const std::string longValue(3000, 'L');
     WriteFile(kFile, "# settings\nbefore=1\nvalue=\"s\"\nafter=2\n");
-    pid_t reader = kytotest::Spawn([&]() {
+    pid_t reader = Spawn([&]() {
         std::vector<char> buf(8192);
         int bad = 0;
         for (long i = 0; i < 50000000; ++i) {
@@ -157,7 +143,7 @@ TEST_F(KeyValueTest, ReaderInAnotherProcessNeverSeesATornOrMissingFile) {
         ASSERT_EQ(KLIBCFileSetKeyValue(kFile, "value", v.c_str(), nullptr), 1);
     }
     ASSERT_EQ(KLIBCFileSetKeyValue(kFile, "stop", "yes", nullptr), 1);
-    EXPECT_EQ(kytotest::Wait(reader), 0);
+    EXPECT_EQ(Wait(reader), 0);
     EXPECT_EQ(ListDir("/tmp/kv"), Names{"test.conf"});
 }
 

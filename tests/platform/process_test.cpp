@@ -5,21 +5,15 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <string>
-
-#include <gtest/gtest.h>
 #include <kytoplatform/kytoplatform.h>
 
 #include "sandbox.h"
 
 namespace {
 
-using kytotest::ReadFile;
-using kytotest::WriteFile;
-
+using namespace kytotest;
 constexpr const char* kPidFile = "/var/run/test.pid";
-
-class ProcessTest : public kytotest::SandboxTest {};
+using ProcessTest = SandboxTest;
 
 TEST_F(ProcessTest, ExecReturnsTheExitStatusAndMinusOneOnSignalDeath) {
     WriteFile("/tmp/notexec.sh", "#!/bin/sh\nexit 0\n", 0644);
@@ -38,7 +32,7 @@ TEST_F(ProcessTest, ExecReturnsTheExitStatusAndMinusOneOnSignalDeath) {
     // clang-format on
     for (const Case& c : cases) {
         SCOPED_TRACE(std::string(c.prog ? c.prog : "(null)") + " " + (c.script ? c.script : ""));
-        KLIBCErrSetEx(0, "", 0);
+        ClearLastError();
         const char* dash = c.script ? "-c" : nullptr;
         EXPECT_EQ(KLIBCExec(c.prog, dash, c.script, nullptr, nullptr), c.status);
         EXPECT_EQ(KLIBCErrGet(), c.err);
@@ -53,13 +47,9 @@ TEST_F(ProcessTest, ArgumentsEndAtTheFirstNullAndStdinIsDevNull) {
     EXPECT_EQ(KLIBCExec("/bin/sh", "-c", script, nullptr, "ignored"), 0);
     EXPECT_EQ(ReadFile("/tmp/args"), "/bin/sh|");  // argv[0] is the program itself
 
-    char* argv[] = {const_cast<char*>("name"),
-                    const_cast<char*>("-c"),
-                    const_cast<char*>(script),
-                    const_cast<char*>("a"),
-                    const_cast<char*>(""),
-                    const_cast<char*>("$HOME"),
-                    nullptr};
+    std::string words[] = {"name", "-c", script, "a", "", "$HOME"};
+    char* argv[] = {&words[0][0], &words[1][0], &words[2][0], &words[3][0], &words[4][0],
+                    &words[5][0], nullptr};
     EXPECT_EQ(KLIBCExecv("/bin/sh", argv, 1), 0);
     EXPECT_EQ(ReadFile("/tmp/args"), "a||$HOME|");
 
@@ -71,21 +61,21 @@ TEST_F(ProcessTest, ArgumentsEndAtTheFirstNullAndStdinIsDevNull) {
 
     char* noArgv0[] = {nullptr};
     for (char** bad : {static_cast<char**>(nullptr), noArgv0}) {
-        KLIBCErrSetEx(0, "", 0);
+        ClearLastError();
         EXPECT_EQ(KLIBCExecv("/bin/true", bad, 1), -1);
         EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
     }
 }
 
 TEST_F(ProcessTest, ExecvWithoutWaitReturnsAPidToReap) {
-    char* argv[] = {const_cast<char*>("sh"), const_cast<char*>("-c"),
-                    const_cast<char*>("read x < /tmp/fifo; exit 5"), nullptr};
+    std::string words[] = {"sh", "-c", "read x < /tmp/fifo; exit 5"};
+    char* argv[] = {&words[0][0], &words[1][0], &words[2][0], nullptr};
     ASSERT_EQ(mkfifo("/tmp/fifo", 0600), 0);
     int pid = KLIBCExecv("/bin/sh", argv, 0);
     ASSERT_GT(pid, 0);
     EXPECT_EQ(waitpid(pid, nullptr, WNOHANG), 0);  // blocked on the fifo
     EXPECT_EQ(KLIBCExec("/bin/sh", "-c", "echo go > /tmp/fifo", nullptr, nullptr), 0);
-    EXPECT_EQ(kytotest::Wait(pid), 5);
+    EXPECT_EQ(Wait(pid), 5);
 }
 
 TEST_F(ProcessTest, ReadPidFileAcceptsOnlyPositiveNumbers) {
@@ -103,7 +93,7 @@ TEST_F(ProcessTest, ReadPidFileAcceptsOnlyPositiveNumbers) {
         EXPECT_EQ(KLIBCReadPidFile(kPidFile), c.pid) << '"' << c.content << '"';
     }
     for (const Bad& b : bad) {
-        KLIBCErrSetEx(0, "", 0);
+        ClearLastError();
         EXPECT_EQ(KLIBCReadPidFile(b.path), -1);
         EXPECT_EQ(KLIBCErrGet(), b.err);
     }
@@ -122,25 +112,22 @@ TEST_F(ProcessTest, AliveAndKillFollowThePidInTheFile) {
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_FILE_NOT_FOUND);
 
     // The plain kill sends SIGTERM (the child notes it and lives on), the forced one SIGKILL.
-    pid_t child = kytotest::Spawn([] {
+    pid_t child = Spawn([] {
         signal(SIGTERM, [](int) { close(open("/tmp/got-term", O_CREAT | O_WRONLY, 0644)); });
         WriteFile("/tmp/ready", "");
         for (;;)
             pause();
         return 0;
     });
-    for (int i = 0; i < 10000 && !kytotest::PathExists("/tmp/ready"); ++i)
-        usleep(1000);
+    EXPECT_TRUE(WaitFor([] { return PathExists("/tmp/ready"); }));
     WriteFile(kPidFile, std::to_string(child));
     EXPECT_EQ(KLIBCKill(kPidFile, 0), 0);
-    for (int i = 0; i < 10000 && !kytotest::PathExists("/tmp/got-term"); ++i)
-        usleep(1000);
-    EXPECT_TRUE(kytotest::PathExists("/tmp/got-term"));
+    EXPECT_TRUE(WaitFor([] { return PathExists("/tmp/got-term"); }));
     EXPECT_EQ(KLIBCIsProcAlive(kPidFile), 1);
     EXPECT_EQ(KLIBCKill(kPidFile, 1), 0);
-    EXPECT_EQ(kytotest::Wait(child), 128 + SIGKILL);
+    EXPECT_EQ(Wait(child), 128 + SIGKILL);
     EXPECT_EQ(KLIBCIsProcAlive(kPidFile), 0);  // reaped: gone
-    KLIBCErrSetEx(0, "", 0);
+    ClearLastError();
     EXPECT_EQ(KLIBCKill(kPidFile, 0), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_PROCESS);
 }

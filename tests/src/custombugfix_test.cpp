@@ -1,8 +1,4 @@
 // CustomBugFix: merging patch-list entries (build 5644 in the sandbox's version file).
-#include <syslog.h>
-
-#include <sstream>
-
 #include "custombugfix.h"
 #include "deb_builder.h"
 #include "sandbox.h"
@@ -11,14 +7,7 @@ namespace kytotest {
 namespace {
 
 const std::string kBase = "http://updates.example.invalid/smallupdate/5644/";
-
-Json::Value J(const std::string& text) {
-    Json::Value v;
-    std::istringstream in(text);
-    std::string errors;
-    EXPECT_TRUE(Json::parseFromStream(Json::CharReaderBuilder(), in, &v, &errors)) << text;
-    return v;
-}
+const auto J = ParseJson;
 
 std::string Deb(const std::string& package, int fix) {
     return DebFileName(MakeDebPackage(package, SmallFixVersion("6.1", 5644, fix)));
@@ -65,10 +54,10 @@ TEST_F(CustomBugFixTest, NewerEntriesAreFoldedIntoOneResult) {
               1);
 
     EXPECT_EQ(fix.m_smallFixNumber, 5);
-    EXPECT_EQ(fix.m_smallUpdateDeb, Deb("smallupdate", 5));
-    EXPECT_EQ(fix.m_smallUpdateDebLink, kBase + Deb("smallupdate", 5));
-    EXPECT_EQ(fix.m_flashUpdateDeb, Deb("flashupdate", 5));
-    EXPECT_EQ(fix.m_flashUpdateDebLink, kBase + Deb("flashupdate", 5));
+    EXPECT_EQ(fix.m_smallUpdateDeb + " " + fix.m_smallUpdateDebLink,
+              Deb("smallupdate", 5) + " " + kBase + Deb("smallupdate", 5));
+    EXPECT_EQ(fix.m_flashUpdateDeb + " " + fix.m_flashUpdateDebLink,
+              Deb("flashupdate", 5) + " " + kBase + Deb("flashupdate", 5));
     EXPECT_EQ(fix.m_installDebs, (std::vector<std::string>{Deb("webui", 5), Deb("webui", 4)}));
     EXPECT_EQ(fix.m_installDebLinks,
               (std::vector<std::string>{kBase + Deb("webui", 5), kBase + Deb("webui", 4)}));

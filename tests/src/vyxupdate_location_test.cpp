@@ -1,12 +1,5 @@
 // Download location: free-space rules on tmpfs volumes of exact sizes, the download folder,
 // output names and the clean-up of earlier results.
-#include <sys/stat.h>
-#include <syslog.h>
-#include <unistd.h>
-
-#include <string>
-
-#include <gtest/gtest.h>
 #include <kytoplatform/klibc.h>
 
 #include "sandbox.h"
@@ -14,30 +7,17 @@
 
 namespace {
 
-using kytotest::MountVolume;
-using kytotest::PathExists;
-using kytotest::SyslogContains;
-using kytotest::UnmountVolume;
-
-constexpr unsigned long long kMiB = 1024ULL * 1024ULL;
-constexpr unsigned long long kMin = 209715200ULL;  // 200 MiB
-constexpr unsigned long long kPage = 4096ULL;
+using namespace kytotest;
+constexpr unsigned long long kMiB = 1024ULL * 1024ULL, kMin = 200 * kMiB, kPage = 4096ULL;
 const char* kConf = "/etc.defaults/kytoinfo.conf";
-
-using VyxLocationTest = kytotest::SandboxTest;
+using VyxLocationTest = SandboxTest;
 
 TEST_F(VyxLocationTest, FreeSpaceBoundaries) {
-    struct Case {
-        unsigned long long size;
-        int ret;
-        bool sufficient;
-    };
-    const Case cases[] = {
-        {kMin - kPage, 0, false},
-        {kMin, 1, false},
-        {500 * kMiB, 1, false},
-        {500 * kMiB + 1, 1, true},  // rounded up to a page: more than 500 MiB
-    };
+    // clang-format off
+    struct Case { unsigned long long size; int ret; bool sufficient; } cases[] = {
+        {kMin - kPage, 0, false}, {kMin, 1, false}, {500 * kMiB, 1, false},
+        {500 * kMiB + 1, 1, true}};  // rounded up to a page: more than 500 MiB
+    // clang-format on
     for (const Case& c : cases) {
         SCOPED_TRACE(c.size);
         MountVolume("/volume1", c.size);
@@ -57,38 +37,34 @@ TEST_F(VyxLocationTest, FreeSpaceBoundaries) {
 TEST_F(VyxLocationTest, DownloadFolderOnAVolumeWithMoreThanTheMinimumElseRoot) {
     MountVolume("/volume1", kMin);               // exactly the minimum: not offered
     MountVolume("/volume2", 1024 * kMiB, true);  // read-only: not offered
-    std::string folder;
+    std::string folder, path;
     ASSERT_EQ(1, VyxUpdate::PrepareDownloadEnv(folder));
     EXPECT_EQ("//@autoupdate", folder);
-
-    std::string path;
     MountVolume("/volume3", kMin + kPage);
     ASSERT_TRUE(VyxUpdate::FindDownloadVolume(path));
     EXPECT_EQ("/volume3", path);
     UnmountVolume("/volume3");
     MountVolume("/volume3", 300 * kMiB);
-    kytotest::WriteFile("/volume3/@autoupdate/kept.img", "old image");
-    for (const char* state :
-         {"/autoupd@te.info", "/var/run/downloadprogress", "/var/run/download_vyx.pid"}) {
-        kytotest::WriteFile(state, "x");
-    }
+
+    // Earlier results are cleared, earlier images kept; a stray file makes way for a 0700
+    // folder; a folder that cannot be made fails.
+    const char* state[] = {"/autoupd@te.info", "/var/run/downloadprogress",
+                           "/var/run/download_vyx.pid"};
+    for (const char* s : state)
+        WriteFile(s, "x");
+    WriteFile("/volume3/@autoupdate/kept.img", "old image");
     ASSERT_EQ(1, VyxUpdate::PrepareDownloadEnv(folder));
     EXPECT_EQ("/volume3/@autoupdate", folder);
     EXPECT_TRUE(PathExists("/volume3/@autoupdate/kept.img"));
-    EXPECT_FALSE(PathExists("/autoupd@te.info"));
-    EXPECT_FALSE(PathExists("/var/run/downloadprogress"));
-    EXPECT_FALSE(PathExists("/var/run/download_vyx.pid"));
-
-    kytotest::RemoveTree("/volume3/@autoupdate");
-    kytotest::WriteFile("/volume3/@autoupdate", "a stray file");  // removed, then created
+    for (const char* s : state)
+        EXPECT_FALSE(PathExists(s)) << s;
+    RemoveTree(folder);
+    WriteFile(folder, "a stray file");
     ASSERT_EQ(1, VyxUpdate::PrepareDownloadEnv(folder));
-    struct stat st;
-    ASSERT_EQ(0, stat(folder.c_str(), &st));
-    EXPECT_TRUE(S_ISDIR(st.st_mode));
-    EXPECT_EQ(0700u, st.st_mode & 0777);
-
-    kytotest::RemoveTree("/volume3/@autoupdate");
-    ASSERT_EQ(0, symlink("/no/such/target", "/volume3/@autoupdate"));
+    EXPECT_TRUE(IsDirectory(folder));
+    EXPECT_EQ(0700u, ModeOf(folder));
+    RemoveTree(folder);
+    ASSERT_EQ(0, symlink("/no/such/target", folder.c_str()));
     EXPECT_EQ(0, VyxUpdate::PrepareDownloadEnv(folder));
     EXPECT_TRUE(SyslogContains("Fail to mkdir [/volume3/@autoupdate]. [0x"));
 
@@ -101,7 +77,7 @@ TEST_F(VyxLocationTest, DownloadFolderOnAVolumeWithMoreThanTheMinimumElseRoot) {
     EXPECT_EQ("/v/@autoupdate/b.img?sig=1", out);
 }
 
-TEST_F(VyxLocationTest, PlaceForSuppliedImageOnDataVolumes) {
+TEST_F(VyxLocationTest, PlaceForSuppliedImage) {
     MountVolume("/volume1", 5 * 1024 * kMiB, true);
     MountVolume("/volume2", 100 * kMiB);
     MountVolume("/volume3", 5 * 1024 * kMiB);
@@ -110,36 +86,29 @@ TEST_F(VyxLocationTest, PlaceForSuppliedImageOnDataVolumes) {
     ASSERT_EQ(1, VyxUpdate::GetVolumePathForPatch(path, sufficient));
     EXPECT_EQ("/volume3", path);
     EXPECT_TRUE(sufficient);
-    EXPECT_TRUE(SyslogContains("Got a volume /volume1.", LOG_ERR));
-    EXPECT_TRUE(SyslogContains("sad.. /volume1 is not a writable volume.", LOG_ERR));
-    EXPECT_TRUE(SyslogContains("104857600 < 209715200, check next volume.", LOG_ERR));
+    for (const char* line : {"Got a volume /volume1.", "sad.. /volume1 is not a writable volume.",
+                             "104857600 < 209715200, check next volume."})
+        EXPECT_TRUE(SyslogContains(line, LOG_ERR)) << line;
     EXPECT_TRUE(SyslogContains("We get /volume3 to upgrade.", LOG_INFO));
-
     UnmountVolume("/volume3");
     MountVolume("/volume3", 300 * kMiB);
     ASSERT_EQ(1, VyxUpdate::GetVolumePathForPatch(path, sufficient));
     EXPECT_FALSE(sufficient);
-
     UnmountVolume("/volume3");
     EXPECT_EQ(0, VyxUpdate::GetVolumePathForPatch(path, sufficient));
-}
 
-TEST_F(VyxLocationTest, PlaceForSuppliedImageOnOtherModels) {
-    std::string path;
-    bool sufficient = false;
-    kytotest::SetKeyValue(kConf, "supportraid", "YES");
+    // Other models: the root with a marker of the storage kind, or without internal disks
+    // the first USB mount with room.
+    SetKeyValue(kConf, "supportraid", "YES");
     ASSERT_EQ(1, VyxUpdate::GetVolumePathForPatch(path, sufficient));
     EXPECT_EQ("/", path);
-    EXPECT_EQ("0\n", kytotest::ReadFile("/.upgrade_vol").value_or(""));
-    kytotest::SetKeyValue(kConf, "supportraid", "no");
-    kytotest::SetKeyValue(kConf, "support_buildin_storage", "yes");
+    EXPECT_EQ("0\n", ReadFile("/.upgrade_vol").value_or(""));
+    SetKeyValue(kConf, "supportraid", "no");
+    SetKeyValue(kConf, "support_buildin_storage", "yes");
     ASSERT_EQ(1, VyxUpdate::GetVolumePathForPatch(path, sufficient));
-    EXPECT_EQ("1\n", kytotest::ReadFile("/.upgrade_vol").value_or(""));
-
-    // Without internal disks: the first USB mount with room.
-    kytotest::SetKeyValue(kConf, "support_buildin_storage", "no");
-    kytotest::SetKeyValue(kConf, "maxdisks", "0");
-    MountVolume("/volume1", 5 * 1024 * kMiB);  // not a USB mount
+    EXPECT_EQ("1\n", ReadFile("/.upgrade_vol").value_or(""));
+    SetKeyValue(kConf, "support_buildin_storage", "no");
+    SetKeyValue(kConf, "maxdisks", "0");
     MountVolume("/volumeUSB1", 100 * kMiB);
     MountVolume("/volumeUSB2", 300 * kMiB);
     ASSERT_EQ(1, VyxUpdate::GetVolumePathForPatch(path, sufficient));

@@ -170,4 +170,11 @@ DebPackage FailingDeb(const std::string& package, const std::string& version) {
     return pkg;
 }
 
+bool DpkgInstalled(const std::string& package) {
+    std::string out;
+    return RunCommand("dpkg-query -W -f='${Status}' " + ShellQuote(package),
+                      &out) == 0 &&
+           out == "install ok installed";
+}
+
 }  // namespace kytotest

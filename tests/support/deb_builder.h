@@ -57,6 +57,9 @@ DebPackage OrderLoggingDeb(const std::string& package, const std::string& versio
 // leaves the package half-configured).
 DebPackage FailingDeb(const std::string& package, const std::string& version);
 
+// True when the sandbox's dpkg database lists the package as "install ok installed".
+bool DpkgInstalled(const std::string& package);
+
 }  // namespace kytotest
 
 #endif

@@ -23,6 +23,9 @@
 #include <cctype>
 #include <set>
 #include <sstream>
+#include <thread>
+
+#include <kytoplatform/klibc.h>
 
 namespace kytotest {
 namespace {
@@ -393,6 +396,38 @@ void SetKeyValue(const std::string& path, const std::string& key,
     WriteFile(path, out, mode);
 }
 
+std::vector<std::string> FileLines(const std::string& path, const std::string& onlyWith) {
+    std::vector<std::string> out;
+    for (const std::string& line : SplitLines(ReadFile(path).value_or(""))) {
+        if (line.find(onlyWith) != std::string::npos)
+            out.push_back(line);
+    }
+    return out;
+}
+
+mode_t ModeOf(const std::string& path) {
+    struct stat st {};
+    if (stat(path.c_str(), &st) != 0) {
+        ADD_FAILURE() << "cannot stat " << path << ": " << strerror(errno);
+        return 0;
+    }
+    return st.st_mode & 07777;
+}
+
+Json::Value ParseJson(const std::string& text) {
+    Json::Value value;
+    if (!Json::Reader().parse(text, value, false))
+        ADD_FAILURE() << "not JSON: " << text;
+    return value;
+}
+
+std::string Md5Of(const std::string& path) {
+    std::string out;
+    if (!PathExists(path) || Shell("md5sum < '" + path + "'", &out) != 0 || out.size() < 32)
+        return "";
+    return out.substr(0, 32);
+}
+
 // ---- Volumes ----------------------------------------------------------------------------
 
 void MountVolume(const std::string& mountPoint, unsigned long long sizeBytes, bool readOnly) {
@@ -477,6 +512,19 @@ int Shell(const std::string& command, std::string* output) {
         return -1;
     }
     return Wait(pid);
+}
+
+bool WaitFor(const std::function<bool()>& cond, int timeoutMs) {
+    for (int waited = 0; waited < timeoutMs; waited += 20) {
+        if (cond())
+            return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return cond();
+}
+
+void ClearLastError() {
+    KLIBCErrSetEx(0, "", 0);
 }
 
 std::vector<pid_t> LiveChildren() {

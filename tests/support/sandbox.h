@@ -19,6 +19,7 @@
 #define KYTO_TESTS_SUPPORT_SANDBOX_H
 
 #include <sys/types.h>
+#include <syslog.h>
 
 #include <functional>
 #include <map>
@@ -27,6 +28,7 @@
 #include <vector>
 
 #include <gtest/gtest.h>
+#include <json/json.h>
 
 namespace kytotest {
 
@@ -81,6 +83,15 @@ std::map<std::string, std::string> ReadKeyValueFile(const std::string& path);
 void SetKeyValue(const std::string& path, const std::string& key,
                  const std::optional<std::string>& value);
 
+// Lines of a file (without their newline), only those containing `onlyWith` when given.
+std::vector<std::string> FileLines(const std::string& path, const std::string& onlyWith = "");
+// Permission bits (07777) of path; fails the test and returns 0 when stat fails.
+mode_t ModeOf(const std::string& path);
+// Parses JSON text (strict: the whole text is one value); fails the test when it cannot.
+Json::Value ParseJson(const std::string& text);
+// Lower-case hex MD5 of a file's content, "" when it cannot be read.
+std::string Md5Of(const std::string& path);
+
 // ---- Volumes ----------------------------------------------------------------------------
 
 // Mounts a tmpfs of exactly sizeBytes (rounded up to pages) at mountPoint (created), read
@@ -97,10 +108,16 @@ pid_t Spawn(const std::function<int()>& fn);
 int Wait(pid_t pid);
 // Runs a shell command; returns its exit status; output (stdout+stderr) when asked.
 int Shell(const std::string& command, std::string* output = nullptr);
+// Calls cond every 20 ms until it returns true or timeoutMs has passed; returns the last
+// result (a wait for another process, never an assertion about time).
+bool WaitFor(const std::function<bool()>& cond, int timeoutMs = 30000);
 // Pids of this process's children that are still alive (not yet reaped included).
 std::vector<pid_t> LiveChildren();
 // Open descriptors of this process.
 std::vector<int> OpenFds();
+
+// Clears the platform's last error of this thread (KLIBCErrSetEx(0, "", 0)).
+void ClearLastError();
 
 // ---- Recorded calls of the fake appliance programs --------------------------------------
 
