@@ -8,6 +8,7 @@
 
 namespace {
 
+using namespace kytotest;
 const char* kFeed = "/var/run/autoupdate_tmp_file_RSS";
 
 struct Model {
@@ -29,11 +30,11 @@ std::string Item(const std::string& major, const std::string& minor, const std::
     return s + "  </item>\n";
 }
 
-class VyxFeedTest : public kytotest::SandboxTest {
+class VyxFeedTest : public SandboxTest {
   protected:
     // Parses the items against the provisioned 5.2 build 5644 "demo_model".
     int Parse(const std::string& items, bool hotfixOnly = false) {
-        kytotest::WriteFile(
+        WriteFile(
             kFeed, "<rss>\n<channel>\n<title>feed</title>\n\n" + items + "</channel>\n</rss>\n");
         memset(&current, 0, sizeof(current));
         EXPECT_EQ(1, VyxUpdate::GetVyxInfo(current));
@@ -48,15 +49,14 @@ class VyxFeedTest : public kytotest::SandboxTest {
 TEST_F(VyxFeedTest, FirstMatchingItemWinsAndOtherModelsAreCleared) {
     ASSERT_EQ(1, Parse(Item("5", "2", "5700", {kOther, kMine}) + Item("5", "3", "9000", {kMine})));
     EXPECT_TRUE(found);
-    EXPECT_STREQ("5700", release.buildNum);
-    EXPECT_STREQ("demo_model", release.unique);
-    EXPECT_STREQ("http://h/img/mine.img", release.link);
-    EXPECT_STREQ("aa11", release.checksum);
+    EXPECT_EQ("5700 demo_model http://h/img/mine.img aa11",
+              std::string(release.buildNum) + " " + release.unique + " " + release.link + " " +
+                  release.checksum);
 
     unlink(kFeed);
     EXPECT_EQ(0, VyxUpdate::ParseRssFile(false, current, found, release));
     EXPECT_TRUE(found);  // untouched
-    EXPECT_TRUE(kytotest::SyslogContains("Fail to open [/var/run/autoupdate_tmp_file_RSS]"));
+    EXPECT_TRUE(SyslogContains("Fail to open [/var/run/autoupdate_tmp_file_RSS]"));
 }
 
 TEST_F(VyxFeedTest, ItemsThatAreNotWantedAreSkipped) {
@@ -126,7 +126,7 @@ TEST_F(VyxFeedTest, ScannerAcceptsOnlyWellFormedBoundedLinesAndKeepsTheKind) {
         EXPECT_EQ(c.kind, kind);
     }
     EXPECT_TRUE(
-        kytotest::SyslogContains("Left tag [MajorVer] and right tag [MinorVer] don't match"));
+        SyslogContains("Left tag [MajorVer] and right tag [MinorVer] don't match"));
     EXPECT_EQ(0x0D00, KLIBCErrGet());
 }
 
