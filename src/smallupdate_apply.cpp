@@ -38,8 +38,8 @@ bool SmallUpdate::Apply() {
     }
     {
         char installed[8] = {0};
-        if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", installed,
-                                 sizeof(installed), 0) <= 0) {
+        if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", installed, sizeof(installed),
+                                 0) <= 0) {
             snprintf(installed, sizeof(installed), "%s", "0");
         }
         std::ostringstream line;
@@ -97,15 +97,14 @@ bool SmallUpdate::Apply() {
 REPORT:
     UpdateApplyProgress(percentage, stage, kErrSystem);
 
-CLEANUP:
-    {
-        char passiveDir[4095] = {0};
-        if (KLIBCFileGetKeyValue(kyto::kPassiveInfoFile, "debDir", passiveDir, sizeof(passiveDir),
-                                 0) > 0) {
-            UpdateUtil::RemoveFolder(passiveDir);
-            unlink(kyto::kPassiveInfoFile);
-        }
+CLEANUP : {
+    char passiveDir[4095] = {0};
+    if (KLIBCFileGetKeyValue(kyto::kPassiveInfoFile, "debDir", passiveDir, sizeof(passiveDir), 0) >
+        0) {
+        UpdateUtil::RemoveFolder(passiveDir);
+        unlink(kyto::kPassiveInfoFile);
     }
+}
     UpdateUtil::RemoveFolder(m_debDir);
     unlink(kyto::kAutoUpdateInfoFile);
     return ok;

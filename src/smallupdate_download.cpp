@@ -18,6 +18,7 @@
 #include <kytoplatform/klibc.h>
 
 #include "kyto_paths.h"
+#include "platform_error.h"
 #include "scoped.h"
 #include "update_cpputil.h"
 
@@ -63,8 +64,8 @@ bool SmallUpdate::ExecWgetP(const std::string& link, const std::string& folder) 
            argv[0], argv[1], argv[2], argv[3], argv[4], argv[5], r);
     // wget has created the output file before it failed: a partial file never stays.
     if (unlink(output) != 0) {
-        syslog(LOG_ERR, "%s:%d failed to unlink %s[0x%04X %s:%d]", kModule, __LINE__, output,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d failed to unlink %s%s", kModule, __LINE__, output,
+               kyto::LastErrorText().c_str());
     }
     return false;
 }
@@ -86,8 +87,7 @@ bool SmallUpdate::DownloadFiles(bool& stopped) {
     int percentage = 0;
     std::vector<std::string> links;
 
-    if (m_installDebLinks.empty() && m_smallUpdateDebLink.empty() &&
-        m_flashUpdateDebLink.empty()) {
+    if (m_installDebLinks.empty() && m_smallUpdateDebLink.empty() && m_flashUpdateDebLink.empty()) {
         goto FAIL;
     }
     unlink(kyto::kDownloadStatusFile);
@@ -198,8 +198,8 @@ void SmallUpdate::GetDownloadStatus(int& percentage, std::string& status) {
 bool SmallUpdate::CancelDownload() {
     kyto::UniqueFd marker(open(kStopMarker, O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
     if (!marker.valid() && !StopRequested()) {
-        syslog(LOG_ERR, "%s:%d failed to create stop status file[0x%04X %s:%d]", kModule,
-               __LINE__, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d failed to create stop status file%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return false;
     }
     UpdateDownloadProgress(0, DOWNLOAD_STATUS_STOPPED);

@@ -19,7 +19,9 @@
 #include <kytoplatform/klibc.h>
 
 #include "custombugfix.h"
+#include "json_members.h"
 #include "kyto_paths.h"
+#include "platform_error.h"
 #include "scoped.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
@@ -85,13 +87,12 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
     char buildNumber[64] = {0};
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buildNumber, sizeof(buildNumber),
                              0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get buildnumber Fail[0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         m_errno = 3;
         return false;
     }
-    const std::string url =
-        base + "/" + buildNumber + "/" + m_unique + "/" + kPatchListName;
+    const std::string url = base + "/" + buildNumber + "/" + m_unique + "/" + kPatchListName;
 
     InitCurlOnce();
     CurlEasy curl;
@@ -177,11 +178,8 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
                "unique");
         return false;
     }
-    // A "unique" that jsoncpp cannot turn into text (a container) matches no model.
-    const Json::Value& uniqueValue = root["unique"];
-    const std::string listUnique =
-        uniqueValue.isConvertibleTo(Json::stringValue) ? uniqueValue.asString() : std::string();
-    if (!uniqueValue.isConvertibleTo(Json::stringValue) || listUnique != m_unique) {
+    const std::string listUnique = kyto::MemberText(root, "unique");
+    if (listUnique != m_unique) {
         m_errno = 7;
         syslog(LOG_ERR, "%s:%d unique not match [%s] unique in json[%s]", kModule, __LINE__,
                m_unique.c_str(), listUnique.c_str());
@@ -190,8 +188,8 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
 
     char buf[32] = {0};
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buf, sizeof(buf), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get buildnumber Fail[0x%04X %s:%d]", kModule, __LINE__,
-               KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return false;
     }
     const int runningBuild = static_cast<int>(strtol(buf, nullptr, 10));
@@ -280,8 +278,8 @@ bool SmallUpdate::HaveNewFix() {
 
 bool SmallUpdate::CheckPatchIsSmallUpdate(const std::string& archive, bool& isSmallUpdate) {
     char command[512] = {0};
-    snprintf(command, sizeof(command), "/bin/tar -tf %s | /bin/grep '%s' | wc -l",
-             archive.c_str(), kPatchListName);
+    snprintf(command, sizeof(command), "/bin/tar -tf %s | /bin/grep '%s' | wc -l", archive.c_str(),
+             kPatchListName);
     kyto::UniqueFile pipe(popen(command, "re"), kyto::UniqueFile::kPopen);
     if (!pipe) {
         return false;

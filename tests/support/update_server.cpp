@@ -287,4 +287,20 @@ std::string PatchListJson(int build, const std::string& unique,
     return Json::FastWriter().write(root);
 }
 
+void UpdateServerTest::SetUp() {
+    SandboxTest::SetUp();
+    server = std::make_unique<UpdateServer>();
+    server->PointSmallInfoPathHere();
+    MountVolume("/volume1", 300ULL << 20);
+}
+
+void UpdateServerTest::TearDown() {
+    server.reset();
+    SandboxTest::TearDown();
+}
+
+std::string SmallFixDebName(const std::string& name, int fix, int build) {
+    return name + "_6.1-" + std::to_string(build) + "-s" + std::to_string(fix) + "_all.deb";
+}
+
 }  // namespace kytotest

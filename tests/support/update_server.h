@@ -8,9 +8,12 @@
 
 #include <sys/types.h>
 
+#include <memory>
 #include <string>
 #include <utility>
 #include <vector>
+
+#include "sandbox.h"
 
 namespace kytotest {
 
@@ -89,6 +92,19 @@ class UpdateServer {
     int port_ = 0;
     std::string root_;
 };
+
+// Base fixture of the small-update tests: a loopback update server that the patch-list
+// lookup points at (started in SetUp, stopped before the sandbox's own checks in
+// TearDown) and a 300 MiB data volume at /volume1 for the package folder.
+class UpdateServerTest : public SandboxTest {
+  protected:
+    void SetUp() override;
+    void TearDown() override;
+    std::unique_ptr<UpdateServer> server;
+};
+
+// "<name>_6.1-<build>-s<fix>_all.deb": a package file name carrying a small-fix number.
+std::string SmallFixDebName(const std::string& name, int fix, int build = 5644);
 
 }  // namespace kytotest
 
