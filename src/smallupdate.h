@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include <json/json.h>
 #include <kytoplatform/kytoconf.h>
 
 #include "kyto_export.h"
@@ -32,6 +33,18 @@ class KYTO_EXPORT SmallUpdate {
         APPLY_STAGE_START_SERVICE = 4,
         APPLY_STAGE_FINISHED = 5,
         APPLY_STAGE_REBOOT = 6,
+    };
+
+    // Reason of the last failure, kept in m_errno and read by GetErrno.
+    enum ERROR_CODE {
+        ERROR_CODE_NONE = 0,
+        ERROR_CODE_SERVER_STATUS = 1,    // the server answered neither 200 nor 404
+        ERROR_CODE_NO_ROOM = 2,          // no volume has room for the download
+        ERROR_CODE_BAD_INPUT = 3,        // bad argument, unreadable build, invalid info file
+        ERROR_CODE_BUILD_MISMATCH = 4,   // the info file is for another build (or unchecked)
+        ERROR_CODE_BAD_FIX_NUMBER = 5,   // small-fix number below 1, or a list for another build
+        ERROR_CODE_DOWNGRADE = 6,        // older than the small fix already installed
+        ERROR_CODE_OTHER_MODEL = 7,      // the patch list is for another device model
     };
 
     SmallUpdate();
@@ -102,7 +115,7 @@ class KYTO_EXPORT SmallUpdate {
     static bool FilesExist(const std::string& folder, const std::vector<std::string>& names);
 
     // The record.
-    int m_errno;
+    int m_errno;  // an ERROR_CODE
     KytoConf m_conf;
     std::string m_unique;
     int m_newSmallFixNumber;
@@ -120,6 +133,15 @@ class KYTO_EXPORT SmallUpdate {
     bool m_blNeedReboot;
     std::vector<std::string> m_vyxServiceRestartList;
     std::vector<std::string> m_pkgRestartList;
+
+  private:
+    // Steps of ImportInfoFile: the fields taken from a complete info file of this build.
+    bool StoreInfoFields(const Json::Value& info);
+    // Steps of DumpToInfoFile: the document, the package check (logged), the target path
+    // (and the passive marker file).
+    Json::Value InfoDocument(bool blPassive) const;
+    bool InfoPackagesAreConsistent() const;
+    bool InfoFileTarget(bool blPassive, std::string& target) const;
 };
 
 #endif
