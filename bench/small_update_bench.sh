@@ -1,0 +1,153 @@
+#!/bin/bash
+# Small-update benchmark (run by hand, not by CI).
+#
+# A small update of 50 packages (1 MiB each) is published by the loopback update server.
+# Each round times, inside the test sandbox (build-bench/tests/kyto-sandbox, so no fixed
+# appliance path of this machine is touched):
+#   library  SmallUpdate::Download(true) of the 50 packages (the patch-list lookup before
+#            it is not timed), then SmallUpdate::Apply() of them;
+#   plain    50 runs of "wget -O <file> <url>", then 50 runs of "dpkg -i <file>".
+# Both sides' wget write their usual progress log to a file and both sides' dpkg append
+# their output to a log file.  The installed packages are purged between runs (not timed).
+# Rounds alternate which side goes first (library first in odd rounds, plain first in even
+# ones), so that warm caches favour neither.  Prints every run and the median ratios
+# library/plain for the download and for the apply.
+#
+# Usage: bench/small_update_bench.sh [ROUNDS]      (default 6; needs root, like the tests)
+set -euo pipefail
+
+SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
+
+if [ "${1:-}" != "--inside" ]; then
+    ROUNDS=${1:-6}
+    BUILD="$SRC/build-bench"
+    cmake -S "$SRC" -B "$BUILD" -DCMAKE_BUILD_TYPE=Release -DKYTO_BUILD_BENCH=ON >/dev/null
+    cmake --build "$BUILD" -j2 --target kyto-sandbox small_update_bench >/dev/null
+    exec "$BUILD/tests/kyto-sandbox" /bin/bash "$SRC/bench/small_update_bench.sh" --inside \
+        "$BUILD" "$ROUNDS"
+fi
+
+# ---- inside the sandbox ----------------------------------------------------------------
+BUILD=$2
+ROUNDS=$3
+DRIVER="$BUILD/bench/small_update_bench"
+COUNT=50
+BUILDNUM=$(sed -n 's/^buildnumber="\{0,1\}\([0-9]*\)"\{0,1\}$/\1/p' /etc.defaults/VERSION)
+UNIQUE=$(sed -n 's/^unique="\{0,1\}\([^"]*\)"\{0,1\}$/\1/p' /etc.defaults/kytoinfo.conf)
+SERVED=/srv/bench
+PLAIN=/volume2/plain
+cd /
+
+mkdir -p /volume1 /volume2 "$SERVED/debs" /tmp/benchpkg
+mount -t tmpfs -o size=512m tmpfs /volume1
+mount -t tmpfs -o size=512m tmpfs /volume2
+
+# The packages: benchNN_6.1-<build>-s1_all.deb, each shipping 1 MiB of random data.
+NAMES=()
+for i in $(seq -w 1 "$COUNT"); do
+    pkg="bench$i"
+    NAMES+=("$pkg")
+    root="/tmp/benchpkg/$pkg"
+    mkdir -p "$root/DEBIAN" "$root/usr/share/$pkg"
+    head -c $((1 << 20)) /dev/urandom >"$root/usr/share/$pkg/payload"
+    cat >"$root/DEBIAN/control" <<CONTROL
+Package: $pkg
+Version: 6.1-$BUILDNUM-s1
+Architecture: all
+Maintainer: Bench <bench@example.invalid>
+Description: small-update benchmark package $i
+CONTROL
+    dpkg-deb --root-owner-group -b "$root" "$SERVED/debs/${pkg}_6.1-$BUILDNUM-s1_all.deb" \
+        >/dev/null
+done
+rm -rf /tmp/benchpkg
+
+PORT_FILE=$(mktemp)
+python3 "$SRC/tests/support/update_server.py" "$SERVED" >"$PORT_FILE" &
+SERVER_PID=$!
+trap 'kill "$SERVER_PID" 2>/dev/null; wait "$SERVER_PID" 2>/dev/null || true' EXIT
+for _ in $(seq 100); do
+    [ -s "$PORT_FILE" ] && break
+    sleep 0.1
+done
+PORT=$(head -n1 "$PORT_FILE")
+BASE="http://127.0.0.1:$PORT"
+
+# The patch list: one fix (1) naming the 50 packages.
+LIST_DIR="$SERVED/smallupdate/$BUILDNUM/$UNIQUE"
+mkdir -p "$LIST_DIR"
+{
+    printf '{"vyxversion":%s,"unique":"%s","smallupdate":[{"version":1,' "$BUILDNUM" "$UNIQUE"
+    printf '"flash_upgrade":false,"config_upgrade":false,"restart":"none","proj":['
+    sep=""
+    for pkg in "${NAMES[@]}"; do
+        printf '%s{"name":"%s","url":"%s/debs/%s_6.1-%s-s1_all.deb"}' "$sep" "$pkg" "$BASE" \
+            "$pkg" "$BUILDNUM"
+        sep=","
+    done
+    printf ']}]}\n'
+} >"$LIST_DIR/VYX-Security.json"
+echo "small_info_path=\"$BASE/smallupdate\"" >>/etc.defaults/kytoinfo.conf
+
+now() { date +%s.%N; }
+elapsed() { awk -v a="$1" -v b="$2" 'BEGIN { printf "%.6f", b - a }'; }
+
+reset() {
+    dpkg -P "${NAMES[@]}" >/dev/null 2>&1 || true
+    sed -i '/^smallfixnumber=/d' /etc.defaults/VERSION
+    rm -rf /volume1/@smallupd@te_deb /autoupd@te.info "$PLAIN" /smallupd@te
+}
+
+run_library() {
+    reset
+    LIB_DL=$("$DRIVER" download 2>>/tmp/library-wget.log)
+    LIB_AP=$("$DRIVER" apply)
+}
+
+run_plain() {
+    reset
+    mkdir -p "$PLAIN"
+    local t0 t1 t2 pkg file
+    t0=$(now)
+    for pkg in "${NAMES[@]}"; do
+        file="${pkg}_6.1-$BUILDNUM-s1_all.deb"
+        wget -O "$PLAIN/$file" "$BASE/debs/$file" 2>>/tmp/plain-wget.log
+    done
+    t1=$(now)
+    for pkg in "${NAMES[@]}"; do
+        dpkg -i "$PLAIN/${pkg}_6.1-$BUILDNUM-s1_all.deb" >>/tmp/plain-dpkg.log 2>&1
+    done
+    t2=$(now)
+    RAW_DL=$(elapsed "$t0" "$t1")
+    RAW_AP=$(elapsed "$t1" "$t2")
+}
+
+median() {
+    printf '%s\n' "$@" | sort -g | awk '{a[NR]=$1} END {
+        if (NR % 2) print a[(NR + 1) / 2]; else print (a[NR / 2] + a[NR / 2 + 1]) / 2 }'
+}
+
+DL_RATIOS=()
+AP_RATIOS=()
+echo "packages: $COUNT x 1 MiB, rounds: $ROUNDS"
+printf '%-6s %-8s %10s %10s %8s %10s %10s %8s\n' round first lib_dl raw_dl ratio lib_ap \
+    raw_ap ratio
+for round in $(seq "$ROUNDS"); do
+    if [ $((round % 2)) -eq 1 ]; then
+        first=library
+        run_library
+        run_plain
+    else
+        first=plain
+        run_plain
+        run_library
+    fi
+    dl=$(awk -v a="$LIB_DL" -v b="$RAW_DL" 'BEGIN { printf "%.6f", a / b }')
+    ap=$(awk -v a="$LIB_AP" -v b="$RAW_AP" 'BEGIN { printf "%.6f", a / b }')
+    DL_RATIOS+=("$dl")
+    AP_RATIOS+=("$ap")
+    printf '%-6s %-8s %10.3f %10.3f %8.3f %10.3f %10.3f %8.3f\n' "$round" "$first" "$LIB_DL" \
+        "$RAW_DL" "$dl" "$LIB_AP" "$RAW_AP" "$ap"
+done
+printf 'median ratio library/plain, download: %.3f\n' "$(median "${DL_RATIOS[@]}")"
+printf 'median ratio library/plain, apply:    %.3f\n' "$(median "${AP_RATIOS[@]}")"
