@@ -114,6 +114,21 @@ class KYTO_EXPORT SmallUpdate {
     static bool FilesExist(const std::string& folder, const std::string& name);
     static bool FilesExist(const std::string& folder, const std::vector<std::string>& names);
 
+    // ---- Service restart around an apply (called by the driving program) ----
+    // false stops, true starts the services the update touches: all of them through the
+    // platform for a reboot-type update, every start-up script for a restart-all update,
+    // else only the listed scripts and packages.
+    void SwitchServices(bool on) const;
+    void SwitchAllService(bool on) const;
+    void SwitchPartialServices(bool on) const;
+    // Full paths of the start-up scripts a restart-all must never touch; false when the
+    // list file cannot be read.
+    static bool GetInvalidRestartService(std::vector<std::string>& invalid);
+    void GetRestartServiceList(std::vector<std::string>& vyxServices,
+                               std::vector<std::string>& packages) const;
+    // 0 nothing (or no update ready), 1 partial, 2 all start-up scripts, 3 reboot-type.
+    int GetServiceRestartType();
+
     // The record.
     int m_errno;  // an ERROR_CODE
     KytoConf m_conf;

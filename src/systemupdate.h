@@ -14,11 +14,29 @@ class KYTO_EXPORT SystemUpdate {
   public:
     SystemUpdate();
 
+    // Asks the full-release engine, then the small-update engine, for a newer update; 1 when
+    // the question could be answered (blHaveUpdate set), 0 when it could not.
+    int CheckNewUpdate(bool& blHaveUpdate);
+    // "vyx" for a full release, "smallupdate" otherwise; "" when a needed check fails.
+    std::string GetUpdateType();
+    // Display text of the offered version; checks again while it is empty.
+    std::string GetFullVersion();
+    // Takes the update type from the info file of a finished download; 1 when recognised.
+    int ImportInfoFile();
+    // Downloads, applies (small updates only) or cancels through the right engine; 1 success.
+    int Download();
+    int Apply();
+    int CancelDownload();
+
     SmallUpdate m_smallUpdate;
     VyxUpdate m_vyxUpdate;
     int m_updateType;  // 0 none, 1 full release, 2 small update
     std::string m_fullVersion;
     bool m_blChecked;
+
+  private:
+    // Removes a status file left by a stopped or failed download of either engine.
+    void TidyDownloadStatus();
 };
 
 #endif
