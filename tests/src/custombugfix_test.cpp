@@ -23,11 +23,10 @@ Json::Value Proj(const std::string& name, int fix, const std::string& package = 
 
 Json::Value Entry(int version, const std::vector<Json::Value>& proj,
                   const Json::Value& restart = "none", bool flash = false, bool config = false) {
-    Json::Value e;
-    e["version"] = version;
-    e["proj"] = Json::Value(Json::arrayValue);
+    Json::Value e = J(R"({"proj": []})");
     for (const auto& p : proj)
         e["proj"].append(p);
+    e["version"] = version;
     e["flash_upgrade"] = flash;
     e["config_upgrade"] = config;
     e["restart"] = restart;
@@ -94,39 +93,36 @@ TEST_F(CustomBugFixTest, OldEntriesOnlyRaiseTheNumberButNeedAllKeys) {
 }
 
 TEST_F(CustomBugFixTest, RestartDemands) {
-    const std::string kWrongType = "wrong type of json format at 'restart' object";
-    struct Case {
-        std::string restart;  // JSON text
-        std::string message;  // "" when accepted
-        std::vector<std::string> services;
-    } cases[] = {
-        {R"("none")", "", {}},
-        {R"("reboot")", "", {}},
-        {R"("all_service")", "", {}},
+    const std::string kWrongType = "wrong type of json format at 'restart' object",
+                      kBadFormat = "bad format in 'restart'";
+    // restart as JSON text, the error ("" when accepted), the services taken.
+    // clang-format off
+    struct Case { std::string restart, message; std::vector<std::string> services; } cases[] = {
+        {R"("none")", "", {}}, {R"("reboot")", "", {}}, {R"("all_service")", "", {}},
         {R"("sometimes")", "bad value in 'restart'", {}},
         {R"({"vyx_service": [], "pkg": []})", "no data in pkg or vyx_service", {}},
-        {R"({"vyx_service": ["a"]})", "bad format in 'restart'", {}},
-        {R"({"vyx_service": [["a"]], "pkg": []})", "bad format in 'restart'", {}},
+        {R"({"vyx_service": ["a"]})", kBadFormat, {}},
+        {R"({"vyx_service": [["a"]], "pkg": []})", kBadFormat, {}},
         {R"({"vyx_service": [7, "x", "x"], "pkg": []})", "", {"7", "x"}},
-        {R"(["reboot"])", kWrongType, {}},
-        {R"(null)", kWrongType, {}},
-    };
+        {R"(["reboot"])", kWrongType, {}}, {R"(null)", kWrongType, {}}};
+    // clang-format on
     for (const auto& c : cases) {
+        SCOPED_TRACE(c.restart);
         ClearSyslog();
         CustomBugFix fix(3);
         Json::Value entry = SmallOnly(4, J(c.restart));
         entry["flash_upgrade"] = "yes";  // not a boolean: does not read true
-        EXPECT_EQ(fix.Merge(entry), c.message.empty() ? 1 : 0) << c.restart;
+        EXPECT_EQ(fix.Merge(entry), c.message.empty() ? 1 : 0);
         EXPECT_FALSE(fix.m_blFlashUpdate);
-        EXPECT_EQ(fix.m_blNeedReboot, c.restart == R"("reboot")") << c.restart;
-        EXPECT_EQ(fix.m_blRestartAllService, c.restart == R"("all_service")") << c.restart;
-        EXPECT_EQ(fix.m_vyxServiceRestartList, c.services) << c.restart;
+        EXPECT_EQ(fix.m_blNeedReboot, c.restart == R"("reboot")");
+        EXPECT_EQ(fix.m_blRestartAllService, c.restart == R"("all_service")");
+        EXPECT_EQ(fix.m_vyxServiceRestartList, c.services);
         if (c.message.empty()) {
             EXPECT_EQ(fix.m_smallUpdateDeb, Deb("smallupdate", 4));
-            EXPECT_TRUE(SyslogMessages().empty()) << c.restart;
+            EXPECT_TRUE(SyslogMessages().empty());
         } else {
-            EXPECT_EQ(fix.m_smallFixNumber, -1) << c.restart;
-            EXPECT_TRUE(SyslogContains(c.message, LOG_ERR)) << c.restart;
+            EXPECT_EQ(fix.m_smallFixNumber, -1);
+            EXPECT_TRUE(SyslogContains(c.message, LOG_ERR));
             EXPECT_TRUE(SyslogContains("failed to merge 'restart' status", LOG_ERR));
         }
     }
@@ -134,12 +130,9 @@ TEST_F(CustomBugFixTest, RestartDemands) {
 
 TEST_F(CustomBugFixTest, BadProjListsAreRefused) {
     const std::string kNothing = "nothing can be parsed from 'proj' array";
-    struct Case {
-        Json::Value proj;
-        std::string message;
-    } cases[] = {
-        {J("[]"), "empty array"},
-        {J(R"({"name": "smallupdate"})"), kNothing},
+    // clang-format off
+    struct Case { Json::Value proj; std::string message; } cases[] = {
+        {J("[]"), "empty array"}, {J(R"({"name": "smallupdate"})"), kNothing},
         {J(R"(["smallupdate"])"), kNothing},
         {J("[" + Json::FastWriter().write(Proj("smallupdate", 4)) + "]"),
          "proj [smallupdate] debversion [4] not match smallfixverion[5]"},
@@ -148,16 +141,17 @@ TEST_F(CustomBugFixTest, BadProjListsAreRefused) {
         {J(R"([{"name": "webui", "url": "http://h/webui.deb"}])"),
          "failed to parse [webui.deb] to get smallfixnum [-1]"},
         {J(R"([{"name": "webui", "url": "http://h/webui_6.1-5644-s0_all.deb"}])"),
-         "failed to parse [webui_6.1-5644-s0_all.deb] to get smallfixnum [0]"},
-    };
+         "failed to parse [webui_6.1-5644-s0_all.deb] to get smallfixnum [0]"}};
+    // clang-format on
     for (const auto& c : cases) {
+        SCOPED_TRACE(c.message);
         ClearSyslog();
         CustomBugFix fix(3);
         Json::Value entry = SmallOnly(5);
         entry["proj"] = c.proj;
-        EXPECT_EQ(fix.Merge(entry), 0) << c.message;
-        EXPECT_TRUE(SyslogContains(c.message, LOG_ERR)) << c.message;
-        EXPECT_TRUE(SyslogContains("failed to merge 'proj'", LOG_ERR)) << c.message;
+        EXPECT_EQ(fix.Merge(entry), 0);
+        EXPECT_TRUE(SyslogContains(c.message, LOG_ERR));
+        EXPECT_TRUE(SyslogContains("failed to merge 'proj'", LOG_ERR));
         EXPECT_EQ(fix.m_smallFixNumber, -1);
     }
 
