@@ -1,0 +1,252 @@
+// The facade as the interface and the auto-update job drive it: which kind of update a check
+// offers (seen in the server's request log), the tidy-up of status files left by either
+// engine, routing of download, apply and cancel, and one update of each kind end to end,
+// observed only through files, logs, programs run and server requests.
+#include <signal.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "deb_builder.h"
+#include "sandbox.h"
+#include "systemupdate.h"
+#include "update_server.h"
+
+using namespace kytotest;
+
+namespace {
+
+const char* const kStatus = "/var/run/downloadVYX.status";
+const char* const kInfo = "/autoupd@te.info";
+const char* const kFeed = "/autoupdate/genRSS.php";
+const char* const kStop = "/tmp/stop_download_smallfix";
+const std::string kList = UpdateServer::PatchListPath(5644, "demo_model");
+
+class SystemUpdateTest : public UpdateServerTest {
+  protected:
+    void SetUp() override {
+        UpdateServerTest::SetUp();
+        server->PointRssServerHere();
+        SetKeyValue("/etc.defaults/VERSION", "smallfixnumber", "3");
+    }
+    // A feed whose one item is build `build` for this model, its image served at /img/full.img.
+    void ServeFeed(int build, unsigned long long imageBytes = 4096) {
+        const std::string sum = Md5Of(server->PutFileOfSize("/img/full.img", imageBytes));
+        server->PutFile(kFeed, "<rss><channel>\n<item>\n<MajorVer>5</MajorVer>\n"
+                               "<MinorVer>2</MinorVer>\n<BuildNum>" +
+                                   std::to_string(build) +
+                                   "</BuildNum>\n<model>\n<mUnique>demo_model</mUnique>\n"
+                                   "<mLink>" +
+                                   server->Url("/img/full.img") + "</mLink>\n<mCheckSum>" + sum +
+                                   "</mCheckSum>\n</model>\n</item>\n</channel></rss>\n");
+    }
+    // A patch list offering fix 5: one real package (with `payload` incompressible bytes) to
+    // install and a restart of S20samba.sh.  Returns the package's URL path.
+    std::string ServeFix(const std::string& pkg = "facadepkg", size_t payload = 0) {
+        DebPackage deb = MakeDebPackage(pkg, SmallFixVersion("6.1", 5644, 5));
+        std::string blob(payload, '\0');
+        unsigned long long x = 88172645463325252ULL;  // xorshift: no compressor shrinks it
+        for (char& c : blob) {
+            x ^= x << 13, x ^= x >> 7, x ^= x << 17;
+            c = static_cast<char>(x);
+        }
+        deb.files["/usr/share/" + pkg + "/blob"] = blob;
+        const std::string path = "/d/" + DebFileName(deb);
+        BuildDeb(deb, server->Root() + "/d");
+        server->PutFile(kList, PatchListJson(5644, "demo_model",
+                                             {{5, {{pkg, server->Url(path)}}, false, false,
+                                               "{\"vyx_service\":[\"S20samba.sh\"],\"pkg\":[]}"}}));
+        return path;
+    }
+};
+
+TEST_F(SystemUpdateTest, CheckOffersTheFullReleaseFirstThenTheSmallFix) {
+    enum Offer { kBoth, kOnlyFix, kNothing, kListError, kFeedError };
+    struct Row {
+        Offer offer;
+        int result;
+        bool flag;  // the caller's flag, which starts true to show "untouched"
+        int type;
+        std::string version;
+        size_t listRequests;
+    } rows[] = {
+        {kBoth, 1, true, 1, "VYX 5.2-5700", 0},  {kOnlyFix, 1, true, 2, "VYX 5.2-5644 update 5", 1},
+        {kNothing, 1, false, 0, "", 1},         {kListError, 0, true, 0, "", 1},
+        {kFeedError, 0, true, 0, "", 0},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.offer);
+        server->ClearRequests();
+        ServeFeed(row.offer == kBoth ? 5700 : 5600);
+        if (row.offer == kFeedError)
+            server->FailPath(kFeed, 500, 1);
+        if (row.offer == kNothing)
+            server->FailPath(kList, 404, 1);
+        if (row.offer == kListError)
+            server->FailPath(kList, 500, 1);
+        if (row.offer != kNothing)
+            ServeFix();
+        SystemUpdate facade;
+        bool flag = true;
+        EXPECT_EQ(row.result, facade.CheckNewUpdate(flag));
+        EXPECT_TRUE(facade.m_blChecked);
+        EXPECT_EQ(row.flag, flag);
+        EXPECT_EQ(row.type, facade.m_updateType);
+        EXPECT_EQ(row.version, facade.m_fullVersion);
+        EXPECT_EQ(row.listRequests, server->RequestsFor(kList).size());
+        // Only the full release answers "vyx"; after a check (failed ones included) the
+        // type is given without checking again.
+        EXPECT_EQ(row.offer == kBoth ? "vyx" : "smallupdate", facade.GetUpdateType());
+        EXPECT_EQ(row.listRequests, server->RequestsFor(kList).size());
+    }
+    // A first GetUpdateType checks; a failed check gives "" and a log line.
+    server->FailPath(kFeed, 500, 1);
+    SystemUpdate fresh;
+    EXPECT_EQ("", fresh.GetUpdateType());
+    EXPECT_TRUE(SyslogContains("systemupdate:", LOG_ERR) &&
+                SyslogContains("Fail to check new update", LOG_ERR));
+}
+
+TEST_F(SystemUpdateTest, CheckTidiesStatusFilesLeftByEitherEngine) {
+    ServeFeed(5600);
+    server->FailPath(kList, 404);
+    const std::string vyx = "updateType=\"vyxupdate\"\npatchPath=\"/volume1/a.img\"\n"
+                            "downloadCount=\"1\"\ndownloadNum=\"1\"\ndownloadStatus=";
+    struct Row {
+        std::string status;
+        bool liveDownloader, kept;
+    } rows[] = {
+        {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"2\"\n", false, true},
+        {"updateType=\"smallupdate\"\npercentage=\"0\"\ndownloadStatus=\"1\"\n", false, true},
+        {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"4\"\n", false, false},
+        {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"5\"\n", false, false},
+        {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"9\"\n", false, false},
+        {"updateType=\"smallupdate\"\ndownloadStatus=\"2\"\n", false, false},
+        // A running full-release download has no "percentage": the small-update reader
+        // calls it failed, so it goes too; so do stale, stopped and failed ones.
+        {vyx + "\"downloading\"\n", true, false},
+        {vyx + "\"downloading\"\n", false, false},
+        {vyx + "\"stopped\"\n", true, false},
+        {vyx + "\"failed\"\n", true, false},
+    };
+    WriteFile("/volume1/a.img", "partial");
+    WriteFile("/var/run/downloadprogress", "Length: 100 [application/octet-stream]\n");
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.status + (row.liveDownloader ? " live" : " gone"));
+        WriteFile(kStatus, row.status);
+        WriteFile("/var/run/downloadVYX.pid",
+                  row.liveDownloader ? std::to_string(getpid()) : "999999");
+        bool flag = false;
+        EXPECT_EQ(1, SystemUpdate().CheckNewUpdate(flag));
+        EXPECT_EQ(row.kept, PathExists(kStatus));
+    }
+}
+
+TEST_F(SystemUpdateTest, CancelReadsTheRunningKindFromTheStatusFile) {
+    struct Row {
+        std::string type;
+        int result;
+        std::string log;
+    } rows[] = {
+        {"", 0, "Fail to get [updateType] from [/var/run/downloadVYX.status]. [0x"},
+        {"other", 0, "Unknown update type [other]"},
+        {"smallupdate", 1, ""},
+        {"vyxupdate", 1, ""},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.type);
+        RemoveTree(kStatus);
+        RemoveTree(kStop);
+        if (!row.type.empty())
+            SetKeyValue(kStatus, "updateType", row.type);
+        ClearSyslog();
+        EXPECT_EQ(row.result, SystemUpdate().CancelDownload());
+        EXPECT_TRUE(row.log.empty() || SyslogContains(row.log, LOG_ERR));
+        EXPECT_EQ(row.type == "smallupdate", PathExists(kStop));
+        // With no pid file there is no full-release download to stop: nothing changes.
+        EXPECT_EQ(row.type == "smallupdate" ? "5" : "",
+                  ReadKeyValueFile(kStatus)["downloadStatus"]);
+    }
+}
+
+// The appliance's road for a small fix: check, download in one process while another polls,
+// services stopped, apply in a fresh process, services started.
+TEST_F(SystemUpdateTest, SmallFixEndToEnd) {
+    ServeFeed(5600);
+    ServeFix("e2epkg");
+    pid_t downloader = Spawn([] {
+        SystemUpdate facade;
+        bool flag = false;
+        return facade.CheckNewUpdate(flag) == 1 && flag && facade.Download() == 1 ? 0 : 1;
+    });
+    EXPECT_EQ(0, Wait(downloader));
+    EXPECT_EQ(1u, server->RequestsFor(kList).size());
+    EXPECT_FALSE(PathExists(kStatus)) << "a finished download is known by its info file";
+    int percentage = 0;
+    std::string word;
+    SmallUpdate().GetDownloadStatus(percentage, word);
+    EXPECT_EQ("100 finished", std::to_string(percentage) + " " + word);
+
+    SystemUpdate fresh;
+    EXPECT_EQ(0, fresh.Apply()) << "a fresh object does not take the type from the info file";
+    EXPECT_TRUE(PathExists(kInfo));
+
+    // The driving program loads the downloaded record, stops, applies, starts.
+    ClearRecordedCalls();
+    SmallUpdate engine;
+    ASSERT_TRUE(engine.IsReadyApply());
+    EXPECT_EQ(1, engine.GetServiceRestartType());
+    engine.SwitchServices(false);
+    ASSERT_TRUE(engine.Apply());
+    engine.SwitchServices(true);
+    EXPECT_EQ((std::vector<std::vector<std::string>>{{"S20samba.sh", "stop"},
+                                                     {"S20samba.sh", "start"}}),
+              RecordedCalls());
+    EXPECT_TRUE(DpkgInstalled("e2epkg"));
+    EXPECT_EQ("5", ReadKeyValueFile("/etc.defaults/VERSION")["smallfixnumber"]);
+    EXPECT_EQ("100 5 ", ReadKeyValueFile("/var/run/applySmallUpd@te.status")["percentage"] + " " +
+                            ReadKeyValueFile("/var/run/applySmallUpd@te.status")["stage"] + " " +
+                            ReadKeyValueFile("/var/run/applySmallUpd@te.status")["ErrMsg"]);
+    EXPECT_FALSE(PathExists(kInfo));
+    bool again = true;
+    EXPECT_EQ(1, SystemUpdate().CheckNewUpdate(again));
+    EXPECT_FALSE(again) << "fix 5 is installed now";
+}
+
+// A full release is downloaded and left for the installer; a cancel from a process that
+// never checked stops either kind of download half-way.
+TEST_F(SystemUpdateTest, FullReleaseDownloadAndCancelOfEachKind) {
+    ServeFeed(5700);
+    SystemUpdate facade;
+    EXPECT_EQ("VYX 5.2-5700", facade.GetFullVersion());
+    ASSERT_EQ(1, facade.Download());
+    EXPECT_EQ("vyxupdate", ParseJson(ReadFile(kInfo).value_or("{}"))["updateType"].asString());
+    EXPECT_EQ(0, facade.Apply()) << "the installer, not the library, installs a release";
+    EXPECT_EQ(1u, server->RequestsFor("/img/full.img").size());
+    EXPECT_TRUE(server->RequestsFor(kList).empty());
+
+    for (bool full : {true, false}) {
+        SCOPED_TRACE(full ? "full release" : "small fix");
+        RemoveTree(kInfo);
+        RemoveTree("/volume1/@autoupdate");
+        ServeFeed(full ? 5700 : 5600, 8 << 20);
+        const std::string deb = ServeFix("cancelpkg", 512 << 10);
+        server->SlowPath(full ? "/img/full.img" : deb, 128 << 10);
+        pid_t downloader = Spawn([] { return SystemUpdate().Download(); });
+        ASSERT_TRUE(WaitFor([&] {
+            return ReadKeyValueFile(kStatus)["downloadStatus"] == (full ? "downloading" : "1");
+        }));
+        EXPECT_EQ(1, SystemUpdate().CancelDownload());
+        Wait(downloader);
+        EXPECT_FALSE(PathExists(kInfo)) << "a stopped download is never recorded as done";
+        EXPECT_EQ(!full, PathExists(kStop)) << "the small downloader leaves its marker at the end";
+        EXPECT_FALSE(full && ReadKeyValueFile(kStatus)["downloadStatus"] == "downloading");
+    }
+}
+
+}  // namespace
