@@ -909,11 +909,9 @@ int VyxUpdate::DownloadImages(Json::Value& record, bool& cancelled) {
     record["minorversion"] = m_release.minor;
     record["majorversion"] = m_release.major;
     record["updateType"] = kyto::kTypeVyx;
-    kyto::UniqueFile info(fopen(kyto::kAutoUpdateInfoFile, "we"));
-    if (info) {
-        Json::FastWriter writer;
-        fputs(writer.write(record).c_str(), info.get());
-    }
+    // For the installer and the interface's poller, which must never read half a record;
+    // a file that cannot be written is not reported, the download itself succeeded.
+    kyto::DumpJsonAtomically(kyto::kAutoUpdateInfoFile, record, false);
     return 1;
 }
 

@@ -6,6 +6,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <new>
 #include <string>
 
 #include <kytoplatform/klibc.h>
@@ -58,23 +59,33 @@ ErrorKeeper::~ErrorKeeper() {
         KLIBCErrSetEx(code_, file_.c_str(), line_);
 }
 
+int CurrentExceptionCode() noexcept {
+    try {
+        throw;
+    } catch (const std::bad_alloc&) {
+        return KYTO_ERR_OUT_OF_MEMORY;
+    } catch (...) {
+        return KYTO_ERR_SYSTEM;
+    }
+}
+
 }  // namespace kytoplat
 
 extern "C" {
 
-int KLIBCErrGet(void) {
+int KLIBCErrGet(void) noexcept {
     return t_lastError.code;
 }
 
-const char* KLIBCErrorGetFile(void) {
+const char* KLIBCErrorGetFile(void) noexcept {
     return t_lastError.file;
 }
 
-int KLIBCErrorGetLine(void) {
+int KLIBCErrorGetLine(void) noexcept {
     return t_lastError.line;
 }
 
-void KLIBCErrSetEx(int code, const char* file, int line) {
+void KLIBCErrSetEx(int code, const char* file, int line) noexcept {
     t_lastError.code = code;
     t_lastError.line = line;
     if (file == nullptr)
@@ -84,16 +95,18 @@ void KLIBCErrSetEx(int code, const char* file, int line) {
     t_lastError.file[len] = '\0';
 }
 
-int KLIBCErrLogSet(const char* logPath, const char* text) {
+int KLIBCErrLogSet(const char* logPath, const char* text) noexcept try {
     if (logPath == nullptr || *logPath == '\0' || text == nullptr) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
     return AppendLine(logPath, text);
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 int KYTOLogSet1(int category, int level, unsigned int eventCode, const char* s1, const char* s2,
-                const char* s3, const char* s4) {
+                const char* s3, const char* s4) noexcept try {
     auto str = [](const char* s) { return s ? s : ""; };
     int len = snprintf(nullptr, 0, "%d %d 0x%08X %s %s %s %s", category, level, eventCode, str(s1),
                        str(s2), str(s3), str(s4));
@@ -110,6 +123,8 @@ int KYTOLogSet1(int category, int level, unsigned int eventCode, const char* s1,
     int rc = AppendLine(KYTO_EVENT_LOG_PATH, text);
     syslog(LOG_NOTICE, "%s", text.c_str());
     return rc;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 }  // extern "C"

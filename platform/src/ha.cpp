@@ -27,15 +27,17 @@ int LoadStatus(std::vector<std::string>* lines) {
 
 extern "C" {
 
-int KYTOHAIsRunning(void) {
+int KYTOHAIsRunning(void) noexcept try {
     std::vector<std::string> lines;
     if (LoadStatus(&lines) != 1)
         return 0;
     std::string running;
     return kytoplat::KvFind(lines, "running", &running) == 1 && running == "yes" ? 1 : 0;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(0);
 }
 
-int KYTOHAIsHybridDL(char* partnerUnique, int size) {
+int KYTOHAIsHybridDL(char* partnerUnique, int size) noexcept try {
     if (partnerUnique == nullptr || size < 1) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -57,6 +59,8 @@ int KYTOHAIsHybridDL(char* partnerUnique, int size) {
     memcpy(partnerUnique, partner.data(), n);
     partnerUnique[n] = '\0';
     return 1;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 }  // extern "C"

@@ -174,7 +174,7 @@ int KvGet(const char* path, const std::string& key, std::string* value) {
 
 extern "C" {
 
-int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags) {
+int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags) noexcept try {
     if (path == nullptr || *path == '\0' || key == nullptr || *key == '\0' || buf == nullptr ||
         size < 1 || flags != 0) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
@@ -193,10 +193,12 @@ int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size,
     memcpy(buf, value.data(), n);
     buf[n] = '\0';
     return static_cast<int>(n);
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
-                         const char* lineFormat) {
+                         const char* lineFormat) noexcept try {
     if (lineFormat == nullptr)
         lineFormat = kDefaultLineFormat;
     if (path == nullptr || *path == '\0' || key == nullptr || *key == '\0' || value == nullptr ||
@@ -279,15 +281,19 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
     }
     cleanup.release();
     return 1;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KLIBCFileExist(const char* path) {
+int KLIBCFileExist(const char* path) noexcept try {
     if (path == nullptr) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return 0;
     }
     struct stat st;
     return ::stat(path, &st) == 0 ? 1 : 0;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(0);
 }
 
 }  // extern "C"

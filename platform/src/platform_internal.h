@@ -17,6 +17,10 @@
 
 // Records code as the thread's last error, with the file and line of the failure site.
 #define KYTO_FAIL(code) KLIBCErrSetEx((code), __FILE__, __LINE__)
+// For the catch clause of every extern "C" call: records the exception being handled as
+// the last error and gives back the call's failure result, so that no exception reaches
+// a C caller (or unwinds through one).
+#define KYTO_FAIL_ON_EXCEPTION(result) kytoplat::FailOnException((result), __FILE__, __LINE__)
 
 // Internal: hidden from the library's exported symbols.
 #pragma GCC visibility push(hidden)
@@ -28,6 +32,16 @@ using kyto::ScopedUnlink;
 using kyto::UniqueFd;
 using kyto::UniqueFile;
 using kyto::WaitForChild;
+
+// Code of the exception being handled: KYTO_ERR_OUT_OF_MEMORY for std::bad_alloc,
+// KYTO_ERR_SYSTEM for anything else.  Only inside a catch clause.
+int CurrentExceptionCode() noexcept;
+
+template <typename Result>
+Result FailOnException(Result result, const char* file, int line) noexcept {
+    KLIBCErrSetEx(CurrentExceptionCode(), file, line);
+    return result;
+}
 
 // Snapshot of the thread's last error, put back when the keeper goes out of scope unless
 // dismissed.  Used by calls that try something whose failure is not their own failure

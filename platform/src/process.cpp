@@ -121,7 +121,7 @@ int WaitProgram(pid_t pid) {
 
 extern "C" {
 
-int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4) {
+int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4) noexcept try {
     if (prog == nullptr || *prog == '\0') {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -136,9 +136,11 @@ int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, 
     if (kytoplat::SpawnProgram(prog, argv, &pid, &execFailed) != 0)
         return -1;
     return WaitReporting(pid, execFailed);
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KLIBCExecv(const char* prog, char* const argv[], int blWait) {
+int KLIBCExecv(const char* prog, char* const argv[], int blWait) noexcept try {
     if (prog == nullptr || *prog == '\0' || argv == nullptr || argv[0] == nullptr) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -150,9 +152,11 @@ int KLIBCExecv(const char* prog, char* const argv[], int blWait) {
     if (!blWait)
         return pid;
     return WaitReporting(pid, execFailed);
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KLIBCReadPidFile(const char* path) {
+int KLIBCReadPidFile(const char* path) noexcept try {
     if (path == nullptr || *path == '\0') {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -176,9 +180,11 @@ int KLIBCReadPidFile(const char* path) {
     if (pid == 0)
         KYTO_FAIL(KYTO_ERR_NOT_FOUND);
     return pid;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KLIBCIsProcAlive(const char* pidFile) {
+int KLIBCIsProcAlive(const char* pidFile) noexcept try {
     int pid = PidFromFile(pidFile);
     if (pid < 0)
         return 0;
@@ -187,9 +193,11 @@ int KLIBCIsProcAlive(const char* pidFile) {
         return 0;
     }
     return 1;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(0);
 }
 
-int KLIBCKill(const char* pidFile, int blForce) {
+int KLIBCKill(const char* pidFile, int blForce) noexcept try {
     int pid = PidFromFile(pidFile);
     if (pid < 0)
         return -1;
@@ -198,6 +206,8 @@ int KLIBCKill(const char* pidFile, int blForce) {
         return -1;
     }
     return 0;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 }  // extern "C"

@@ -45,7 +45,7 @@ int RunOne(const char* prog, const char* arg) {
 
 extern "C" {
 
-int KYTOServiceOnOffALL(int action) {
+int KYTOServiceOnOffALL(int action) noexcept try {
     if (action != KYTO_SERVICE_STOP_ALL && action != KYTO_SERVICE_START_ALL) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -82,10 +82,14 @@ int KYTOServiceOnOffALL(int action) {
         RunOne(path.c_str(), arg);
     }
     return 0;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KYTOServiceThirdPartyAll(int blStart) {
+int KYTOServiceThirdPartyAll(int blStart) noexcept try {
     return RunOne(kPkgCtl, blStart ? "startall" : "stopall");
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 }  // extern "C"

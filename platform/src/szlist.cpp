@@ -27,7 +27,7 @@ size_t ListBytes(int capacity) {
 
 extern "C" {
 
-PKLIBC_SZLIST KLIBCSzListAlloc(int capacity) {
+PKLIBC_SZLIST KLIBCSzListAlloc(int capacity) noexcept try {
     if (capacity < 1) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return nullptr;
@@ -41,9 +41,11 @@ PKLIBC_SZLIST KLIBCSzListAlloc(int capacity) {
     list->nItem = 0;
     list->nAlloc = capacity;
     return list;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(static_cast<PKLIBC_SZLIST>(nullptr));
 }
 
-int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) {
+int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) noexcept try {
     // A capacity below 1 never comes from KLIBCSzListAlloc and could not be doubled.
     if (text == nullptr || delims == nullptr || list == nullptr || *list == nullptr ||
         (*list)->nAlloc < 1 || (*list)->nItem < 0 || (*list)->nItem > (*list)->nAlloc) {
@@ -96,9 +98,11 @@ int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) {
     for (char* c : copies)
         l->pszItem[l->nItem++] = c;
     return static_cast<int>(copies.size());
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSize) {
+int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSize) noexcept try {
     if (list == nullptr || sep == nullptr || buf == nullptr || bufSize == nullptr || *bufSize < 0 ||
         (*buf == nullptr && *bufSize != 0) || list->nItem < 0 || list->nItem > list->nAlloc) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
@@ -127,9 +131,11 @@ int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSiz
     }
     memcpy(*buf, joined.c_str(), joined.size() + 1);
     return static_cast<int>(joined.size());
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-void KLIBCSzListFree(PKLIBC_SZLIST list) {
+void KLIBCSzListFree(PKLIBC_SZLIST list) noexcept {
     if (list == nullptr)
         return;
     for (int i = 0; i < list->nItem && i < list->nAlloc; ++i)

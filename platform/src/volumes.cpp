@@ -127,7 +127,7 @@ int ReadDataMounts(std::vector<MountEntry>* mounts) {
 
 extern "C" {
 
-PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) {
+PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) noexcept try {
     if (flags != 0) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return nullptr;
@@ -167,9 +167,11 @@ PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) {
     if (head == nullptr)
         KYTO_FAIL(KYTO_ERR_NOT_FOUND);
     return head;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(static_cast<PKYTO_MOUNT_VOL_INFO>(nullptr));
 }
 
-void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node) {
+void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node) noexcept {
     while (node != nullptr) {
         PKYTO_MOUNT_VOL_INFO next = node->pNext;
         free(node);
@@ -177,7 +179,7 @@ void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node) {
     }
 }
 
-int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count) {
+int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count) noexcept try {
     if (flags != 0 || out == nullptr || count < 1) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -206,9 +208,11 @@ int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out,
     }
     KYTOMountVolInfoFree(list);
     return found;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
-int KYTOFSMkdirP(const char* path, mode_t mode) {
+int KYTOFSMkdirP(const char* path, mode_t mode) noexcept try {
     if (path == nullptr || *path == '\0') {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
@@ -234,6 +238,8 @@ int KYTOFSMkdirP(const char* path, mode_t mode) {
         return -1;
     }
     return 0;
+} catch (...) {
+    return KYTO_FAIL_ON_EXCEPTION(-1);
 }
 
 }  // extern "C"

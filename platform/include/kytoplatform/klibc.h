@@ -10,6 +10,8 @@
 
 #include <sys/types.h>
 
+#include "kyto_errors.h"
+
 /* Built with hidden symbols by default: every call declared here is exported. */
 #pragma GCC visibility push(default)
 
@@ -20,15 +22,15 @@ extern "C" {
 /* ---- Errors and logs ---------------------------------------------------------------- */
 
 /* Last error code of this thread, 0 when none was set. */
-int KLIBCErrGet(void);
+int KLIBCErrGet(void) KYTO_NOEXCEPT;
 /* Source file and line where the last error was set ("" and 0 when none). */
-const char* KLIBCErrorGetFile(void);
-int KLIBCErrorGetLine(void);
+const char* KLIBCErrorGetFile(void) KYTO_NOEXCEPT;
+int KLIBCErrorGetLine(void) KYTO_NOEXCEPT;
 /* Sets this thread's last error; the file name is copied (cut to 255 bytes). */
-void KLIBCErrSetEx(int code, const char* file, int line);
+void KLIBCErrSetEx(int code, const char* file, int line) KYTO_NOEXCEPT;
 /* Appends text and a newline to logPath (created 0644) with one write(2) in O_APPEND
  * mode.  0 ok, -1 error. */
-int KLIBCErrLogSet(const char* logPath, const char* text);
+int KLIBCErrLogSet(const char* logPath, const char* text) KYTO_NOEXCEPT;
 
 /* ---- Key=value files ---------------------------------------------------------------- */
 /*
@@ -50,7 +52,7 @@ int KLIBCErrLogSet(const char* logPath, const char* text);
  * 0), 0 when the key is absent, -1 when the file cannot be read or an argument is bad
  * (NULL pointer, empty key, size < 1, flags != 0).  On -1 buf is left untouched; when the
  * key is absent buf holds "".  With size 1 nothing fits: buf is "" and the result 0. */
-int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags);
+int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags) KYTO_NOEXCEPT;
 /* Replaces the first line for key in place (or appends one), keeping every other line and
  * their order; creates the file (0644) when missing.  lineFormat is a printf format with
  * exactly two %s (key, value); NULL means "%s=\"%s\"\n".  The content is written to a
@@ -63,10 +65,10 @@ int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size,
  * of two concurrent updates the later rename wins.  Returns 1 on success, -1 on error
  * (the temporary file is always removed). */
 int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
-                         const char* lineFormat);
+                         const char* lineFormat) KYTO_NOEXCEPT;
 /* 1 when the path exists (file or folder, symbolic links followed), 0 otherwise (NULL:
  * 0 with KYTO_ERR_BAD_PARAMETER; a path that does not exist is not an error). */
-int KLIBCFileExist(const char* path);
+int KLIBCFileExist(const char* path) KYTO_NOEXCEPT;
 
 /* ---- Processes ---------------------------------------------------------------------- */
 
@@ -76,20 +78,20 @@ int KLIBCFileExist(const char* path);
  * is close-on-exec).  Returns the exit status 0..255; -1 when it cannot fork or wait, or
  * the child died by a signal (KYTO_ERR_EXEC).  A program that cannot be executed exits
  * with 127, and the last error is then KYTO_ERR_EXEC. */
-int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4);
+int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4) KYTO_NOEXCEPT;
 /* The same with a NULL-terminated argv (argv[0] included).  With blWait 0 the child's pid
  * is returned without waiting (the caller reaps it). */
-int KLIBCExecv(const char* prog, char* const argv[], int blWait);
+int KLIBCExecv(const char* prog, char* const argv[], int blWait) KYTO_NOEXCEPT;
 /* The decimal pid held in the file; 0 when the content is not a positive number; -1 when
  * the file is missing or unreadable.  Accepted content: digits only, optionally followed
  * by blanks and newlines, value 1..INT_MAX; anything else (leading blanks, a sign, other
  * text, more than 64 bytes) gives 0 with KYTO_ERR_NOT_FOUND. */
-int KLIBCReadPidFile(const char* path);
+int KLIBCReadPidFile(const char* path) KYTO_NOEXCEPT;
 /* 1 when the pid in the file names a live process (signal 0 succeeds), 0 otherwise. */
-int KLIBCIsProcAlive(const char* pidFile);
+int KLIBCIsProcAlive(const char* pidFile) KYTO_NOEXCEPT;
 /* Signals the pid in the file: SIGTERM, or SIGKILL when blForce is non-zero.  0 ok, -1
  * error. */
-int KLIBCKill(const char* pidFile, int blForce);
+int KLIBCKill(const char* pidFile, int blForce) KYTO_NOEXCEPT;
 
 /* ---- String lists ------------------------------------------------------------------- */
 
@@ -102,16 +104,16 @@ typedef struct _tag_KLIBC_SZLIST {
 } KLIBC_SZLIST, *PKLIBC_SZLIST;
 
 /* NULL on bad size (< 1) or no memory. */
-PKLIBC_SZLIST KLIBCSzListAlloc(int capacity);
+PKLIBC_SZLIST KLIBCSzListAlloc(int capacity) KYTO_NOEXCEPT;
 /* Splits text at any character of delims and appends the pieces (empty ones included)
  * to *list, growing it (realloc, *list may move) when full.  Returns the count of items
  * appended, -1 on error. */
-int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list);
+int KLIBCStrSep(const char* text, const char* delims, PKLIBC_SZLIST* list) KYTO_NOEXCEPT;
 /* Joins the items with sep into *buf, growing it with realloc (updating *bufSize) when
  * needed; *buf may be NULL with *bufSize 0.  Returns the length, -1 on error. */
-int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSize);
+int KLIBCSzListJoin(PKLIBC_SZLIST list, const char* sep, char** buf, int* bufSize) KYTO_NOEXCEPT;
 /* Frees the list and its items; NULL is fine. */
-void KLIBCSzListFree(PKLIBC_SZLIST list);
+void KLIBCSzListFree(PKLIBC_SZLIST list) KYTO_NOEXCEPT;
 
 #ifdef __cplusplus
 }

@@ -21,4 +21,13 @@
 #define KYTO_ERR_SYSTEM 0x0D09    /* any other system call failed (statfs, mkdir, ...) */
 #define KYTO_ERR_NOT_FOUND 0x0D0A /* nothing matched (no volume, no key where one is needed) */
 
+/* To C++ callers every platform call is noexcept: a failure, running out of memory
+ * included (KYTO_ERR_OUT_OF_MEMORY), is reported through the last error, never by an
+ * exception. */
+#ifdef __cplusplus
+#define KYTO_NOEXCEPT noexcept
+#else
+#define KYTO_NOEXCEPT
+#endif
+
 #endif

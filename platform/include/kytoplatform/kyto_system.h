@@ -8,6 +8,8 @@
 
 #include <sys/types.h>
 
+#include "kyto_errors.h"
+
 /* Built with hidden symbols by default: every call declared here is exported. */
 #pragma GCC visibility push(default)
 
@@ -22,7 +24,7 @@ extern "C" {
 /* Appends one line "category level 0xCODE s1 s2 s3 s4" (NULL strings as "") to
  * /var/log/kytoevent.log and sends the same text to syslog (LOG_NOTICE).  0 ok, -1 error. */
 int KYTOLogSet1(int category, int level, unsigned int eventCode, const char* s1, const char* s2,
-                const char* s3, const char* s4);
+                const char* s3, const char* s4) KYTO_NOEXCEPT;
 
 /* ---- Volumes and folders ------------------------------------------------------------ */
 
@@ -47,16 +49,16 @@ typedef struct _tag_KYTO_VOLUME_INFO {
  * with statvfs gives KYTO_ERR_SYSTEM).  flags must be 0.  A mount point mounted over more
  * than once is listed once, at its first position, as the last (visible) mount.  Escaped
  * characters in /proc/mounts (\040 ...) are decoded. */
-PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags);
+PKYTO_MOUNT_VOL_INFO KYTOMountVolInfoEnum(int flags) KYTO_NOEXCEPT;
 /* Frees the list from node on; NULL is fine. */
-void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node);
+void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node) KYTO_NOEXCEPT;
 /* Fills out[0] with the first writable data volume whose free bytes are greater than
  * minFree.  count is the number of entries out can hold (at least 1).  1 found, 0 none
  * (no data volume at all is "none", not an error), -1 error. */
-int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count);
+int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count) KYTO_NOEXCEPT;
 /* Creates the folder and its missing parents with mode; 0 ok (also when it already exists
  * as a folder), -1 error. */
-int KYTOFSMkdirP(const char* path, mode_t mode);
+int KYTOFSMkdirP(const char* path, mode_t mode) KYTO_NOEXCEPT;
 
 /* ---- High availability -------------------------------------------------------------- */
 
@@ -64,11 +66,11 @@ int KYTOFSMkdirP(const char* path, mode_t mode);
 
 /* 1 when /var/run/kytoha.status says running="yes", else 0 (a status file that exists
  * but cannot be read also gives 0, with the last error set). */
-int KYTOHAIsRunning(void);
+int KYTOHAIsRunning(void) KYTO_NOEXCEPT;
 /* 1 when the file says hybrid_dl="yes", with partner_unique copied into the buffer (cut to
  * size - 1); 0 when not hybrid (or no file); -1 when the file exists but cannot be read,
  * the partner identity is missing, or an argument is bad. */
-int KYTOHAIsHybridDL(char* partnerUnique, int size);
+int KYTOHAIsHybridDL(char* partnerUnique, int size) KYTO_NOEXCEPT;
 
 /* ---- Services ----------------------------------------------------------------------- */
 
@@ -80,10 +82,10 @@ int KYTOHAIsHybridDL(char* partnerUnique, int size);
  * folder.  Names are ordered bytewise (not by locale); only regular files are run, each
  * directly with execv.  As in an init system, a script that fails or cannot be executed
  * does not stop the others and does not change the result. */
-int KYTOServiceOnOffALL(int action);
+int KYTOServiceOnOffALL(int action) KYTO_NOEXCEPT;
 /* Runs /usr/kyto/bin/kytopkg with "startall" (blStart != 0) or "stopall"; returns its
  * exit status, -1 when it cannot run. */
-int KYTOServiceThirdPartyAll(int blStart);
+int KYTOServiceThirdPartyAll(int blStart) KYTO_NOEXCEPT;
 
 #ifdef __cplusplus
 }
