@@ -1,6 +1,7 @@
 # Debian packages needed to build and test the project; sourced by build.sh and test.sh.
 # Installs only what is missing, so a second run does not touch apt at all.
-KYTO_BUILD_PACKAGES=(cmake g++ make pkg-config libjsoncpp-dev libcurl4-openssl-dev)
+# libcli11-dev: the header-only option parser of the command-line driver (tools/).
+KYTO_BUILD_PACKAGES=(cmake g++ make pkg-config libjsoncpp-dev libcurl4-openssl-dev libcli11-dev)
 KYTO_TEST_PACKAGES=(googletest libgtest-dev libgmock-dev libbenchmark-dev wget openssl tar
     dpkg dpkg-dev python3 util-linux clang-format ca-certificates)
 
