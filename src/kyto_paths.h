@@ -14,6 +14,8 @@ constexpr const char* kApplyStatusFile = "/var/run/applySmallUpd@te.status";
 constexpr const char* kDpkgLog = "/var/log/dpkg_upgrade.log";
 constexpr const char* kUpdateLog = "/var/log/kytoupdate.log";
 constexpr const char* kWget = "/usr/kyto/bin/wget";
+// Package folder of a small update when the caller names none (and on a passive node).
+constexpr const char* kDefaultDebDirName = "/@smallupd@te_deb";
 
 // Free space below which no download place is used by either engine: 200 MiB.
 constexpr unsigned long kMinDownloadFreeBytes = 209715200UL;

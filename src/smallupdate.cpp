@@ -33,9 +33,6 @@ namespace {
 
 constexpr const char* kModule = "smallupdate";
 
-// Folder name used for the download folder in the passive case.
-constexpr const char* kDefaultDebDirName = "/@smallupd@te_deb";
-
 // Extraction folders of the flash and small-update packages, and the staging folder that
 // survives until the next boot.
 constexpr const char* kFlashTempFolder = "/flashUpd@teTempFolder";
@@ -218,7 +215,7 @@ Json::Value SmallUpdate::InfoDocument(bool blPassive) const {
     root["updateType"] = kyto::kTypeSmall;
     root["buildnumber"] = m_buildNumber;
     root["newSmallFixNumber"] = m_newSmallFixNumber;
-    root["debDir"] = blPassive ? std::string(kDefaultDebDirName) : m_debDir;
+    root["debDir"] = blPassive ? std::string(kyto::kDefaultDebDirName) : m_debDir;
     if (m_blNeedReboot) {
         root["blNeedReboot"] = true;
     } else if (m_blRestartAllService) {

@@ -25,9 +25,7 @@
 namespace {
 
 constexpr const char* kModule = "smallupdate";
-constexpr const char* kWget = "/usr/kyto/bin/wget";
 constexpr const char* kStopMarker = "/tmp/stop_download_smallfix";
-constexpr const char* kDefaultDebDirName = "/@smallupd@te_deb";
 // Each wget run makes one try; the retries are counted here.
 constexpr int kWgetAttempts = 10;
 
@@ -54,9 +52,9 @@ bool SmallUpdate::ExecWgetP(const std::string& link, const std::string& folder) 
     snprintf(output, sizeof(output), "%s/%s", folder.c_str(), link.c_str() + slash + 1);
 
     const char* argv[] = {
-        kWget, link.c_str(), "-O", output, "--timeout=15", "--tries=1", "--no-dns-cache", nullptr,
+        kyto::kWget, link.c_str(), "-O", output, "--timeout=15", "--tries=1", "--no-dns-cache", nullptr,
     };
-    const int r = KLIBCExecv(kWget, const_cast<char* const*>(argv), 1);
+    const int r = KLIBCExecv(kyto::kWget, const_cast<char* const*>(argv), 1);
     if (r == 0) {
         return true;
     }
@@ -167,7 +165,7 @@ bool SmallUpdate::Download(bool blDump, const std::string& folderName, bool blPa
 }
 
 bool SmallUpdate::Download(bool blDump) {
-    return Download(blDump, kDefaultDebDirName, false);
+    return Download(blDump, kyto::kDefaultDebDirName, false);
 }
 
 void SmallUpdate::GetDownloadStatus(int& percentage, std::string& status) {
@@ -205,8 +203,8 @@ bool SmallUpdate::CancelDownload() {
     UpdateDownloadProgress(0, DOWNLOAD_STATUS_STOPPED);
     // The download folder's name stands where a pid file would: the platform answers for
     // whatever it names.
-    if (KLIBCIsProcAlive(kDefaultDebDirName)) {
-        KLIBCKill(kDefaultDebDirName, 1);
+    if (KLIBCIsProcAlive(kyto::kDefaultDebDirName)) {
+        KLIBCKill(kyto::kDefaultDebDirName, 1);
     }
     unlink(kyto::kAutoUpdateInfoFile);
     marker.reset();

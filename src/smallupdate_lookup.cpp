@@ -33,7 +33,6 @@ constexpr const char* kModule = "smallupdate";
 // Base address of the patch lists when "small_info_path" is not configured.
 constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
 constexpr const char* kPatchListName = "VYX-Security.json";
-constexpr const char* kDefaultDebDirName = "/@smallupd@te_deb";
 
 // A patch list is a few kilobytes: a server that does not connect within this time, or
 // sends nothing for kLowSpeedSeconds, or has not finished after kTransferSeconds, is
@@ -326,7 +325,7 @@ bool SmallUpdate::ImportSmallPatch(const std::string& archive, const std::string
 }
 
 bool SmallUpdate::ImportSmallPatch(const std::string& archive) {
-    return ImportSmallPatch(archive, kDefaultDebDirName, false);
+    return ImportSmallPatch(archive, kyto::kDefaultDebDirName, false);
 }
 
 std::string SmallUpdate::GetFullVersion() {

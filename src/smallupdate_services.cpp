@@ -15,6 +15,7 @@
 #include <kytoplatform/kyto_system.h>
 
 #include "custombugfix.h"
+#include "platform_error.h"
 #include "scoped.h"
 
 namespace {
@@ -72,8 +73,8 @@ void SmallUpdate::SwitchAllService(bool on) const {
         for (size_t n = 0; n < count; ++n) {
             const char* path = scripts.g.gl_pathv[on ? n : count - 1 - n];
             if (CustomBugFix::Find(invalid, path)) {
-                syslog(LOG_ERR, "%s:%d skip invalid service %s[0x%04X %s:%d]", kModule, __LINE__,
-                       path, KLIBCErrGet(), KLIBCErrorGetFile(), KLIBCErrorGetLine());
+                syslog(LOG_ERR, "%s:%d skip invalid service %s%s", kModule, __LINE__,
+                       path, kyto::LastErrorText().c_str());
                 continue;
             }
             KLIBCExec(path, on ? "start" : "stop", nullptr, nullptr, nullptr);

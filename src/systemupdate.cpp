@@ -11,6 +11,7 @@
 #include <kytoplatform/klibc.h>
 
 #include "kyto_paths.h"
+#include "platform_error.h"
 #include "update_cpputil.h"
 
 namespace {
@@ -139,9 +140,8 @@ int SystemUpdate::CancelDownload() {
     char type[64] = {0};
     if (KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyUpdateType, type, sizeof(type),
                              0) <= 0) {
-        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. [0x%04X %s:%d]", kModule, __LINE__,
-               kyto::kKeyUpdateType, kyto::kDownloadStatusFile, KLIBCErrGet(), KLIBCErrorGetFile(),
-               KLIBCErrorGetLine());
+        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
+               kyto::kKeyUpdateType, kyto::kDownloadStatusFile, kyto::LastErrorText().c_str());
         return 0;
     }
     const std::string word(type);

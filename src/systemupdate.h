@@ -8,6 +8,7 @@
 
 #include "kyto_export.h"
 #include "smallupdate.h"
+#include "update_cpputil.h"
 #include "vyxupdate.h"
 
 class KYTO_EXPORT SystemUpdate {
@@ -30,7 +31,7 @@ class KYTO_EXPORT SystemUpdate {
 
     SmallUpdate m_smallUpdate;
     VyxUpdate m_vyxUpdate;
-    int m_updateType;  // 0 none, 1 full release, 2 small update
+    UpdateUtil::PATCH_TYPE m_updateType;  // the kind found by the check, or PATCH_TYPE_NONE
     std::string m_fullVersion;
     bool m_blChecked;
 
