@@ -263,6 +263,25 @@ bool VyxUpdate::ParseTagValue(const std::string& line, std::string& name, std::s
     return true;
 }
 
+namespace {
+
+// Whether the line opens or closes the element (the feed is read line by line, not as XML).
+bool OpensOrCloses(const std::string& line, const char* element) {
+    const std::string name(element);
+    return line.find("<" + name + ">") != std::string::npos ||
+           line.find("</" + name + ">") != std::string::npos;
+}
+
+// Whether an item whose version fields are read offers an update this system may take:
+// newer than the running version (and a hot-fix of it when only hot-fixes are wanted),
+// and installable on top of it.
+bool ItemIsWanted(bool hotfixOnly, const _tag_vyxinfo_& current, const _tag_vyxinfo_& item) {
+    return !(hotfixOnly && !VyxUpdate::IsHotfix(current, item)) &&
+           VyxUpdate::IsVersionNewer(current, item) && VyxUpdate::SatisfyReqVersion(current, item);
+}
+
+}  // namespace
+
 int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool& found,
                             _tag_vyxinfo_& release) {
     kyto::UniqueFile file(fopen(kRssFile, "re"));
@@ -286,15 +305,14 @@ int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool&
         if (line.empty())
             continue;
 
-        if (line.find("<item>") != std::string::npos || line.find("</item>") != std::string::npos) {
+        if (OpensOrCloses(line, "item")) {
             skipItem = inModel = skipModel = false;
             ClearRecord(release);
         } else if (skipItem) {
             continue;
         }
 
-        if (line.find("<model>") != std::string::npos ||
-            line.find("</model>") != std::string::npos) {
+        if (OpensOrCloses(line, "model")) {
             // The matching model's fields are complete at its closing tag (or at the
             // next model element).
             if (matched)
@@ -315,8 +333,7 @@ int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool&
 
         // Inside a model element the item's version fields are all known: decide whether
         // the item is wanted at all.
-        if ((hotfixOnly && !IsHotfix(current, release)) || !IsVersionNewer(current, release) ||
-            !SatisfyReqVersion(current, release)) {
+        if (!ItemIsWanted(hotfixOnly, current, release)) {
             skipItem = true;
             continue;
         }
@@ -403,7 +420,7 @@ int VyxUpdate::GetRssFile() {
     // The values go into the command as they stand; the configuration is trusted.
     // The command is bounded like a 4096-byte buffer: an over-long URL is cut, and the
     // fetch then fails.
-    std::string command = std::string("/usr/kyto/bin/wget --user-agent='") + agent + "' -O " +
+    std::string command = std::string(kyto::kWget) + " --user-agent='" + agent + "' -O " +
                           kRssFile + " " + server + "?tz=" + timezone + " 2> /dev/null";
     if (command.size() > 4095)
         command.resize(4095);
@@ -833,7 +850,8 @@ int VyxUpdate::SendNotification(bool success, const std::string& patchPath) {
                      kNotifyLinkText, "update:update_download_noti_link");
 }
 
-void VyxUpdate::UpdateVyx(const char*, const char*, bool) {}
+void VyxUpdate::UpdateVyx(const char* /*reserved1*/, const char* /*reserved2*/,
+                          bool /*reserved3*/) {}
 
 bool VyxUpdate::SetStatusKey(const char* key, const char* value) {
     if (UpdateProgressFile(key, value))
@@ -1211,8 +1229,8 @@ bool VyxUpdate::CleanDownloadResult(std::string path) {
             return false;
         }
         // stat never returns a positive value, so an existing download folder and the
-        // images in it are always kept; the removal below is never reached.  Kept as it
-        // has always been.
+        // images in it stay for the installer (a new download of the same link writes over
+        // its image); the folder removal below is never reached.
         if (ret > 0) {
             if (!S_ISDIR(st.st_mode)) {
                 syslog(LOG_ERR, "%s:%d [%s] is neither a file nor a directory", kModule, __LINE__,

@@ -113,7 +113,9 @@ class KYTO_EXPORT VyxUpdate {
     static int VerifyChecksum(const char* expected, const char* path);
     static bool WriteDownloadPidFile();
     int SendNotification(bool success, const std::string& patchPath);
-    static void UpdateVyx(const char* a, const char* b, bool c);
+    // Exported for programs built against earlier releases that still call it; the work
+    // it once did is done by the installer now, so it does nothing.
+    static void UpdateVyx(const char* reserved1, const char* reserved2, bool reserved3);
 
     // ---- Download progress and cancellation ----
     static bool UpdateProgressFile(const char* key, const char* value);
