@@ -11,16 +11,11 @@
 #include <syslog.h>
 
 #include "debian_lib.h"
+#include "json_members.h"
 
 namespace {
 
 constexpr const char* kModule = "custombugfix";
-
-// A flag "reads true" only when jsoncpp can convert it to a boolean and the result is
-// true; a text or a container never sets a flag.
-bool ReadsTrue(const Json::Value& v) {
-    return v.isConvertibleTo(Json::booleanValue) && v.asBool();
-}
 
 // Small-fix number of a held package name; an empty or unreadable name counts as none.
 int HeldFixNumber(const std::string& held) {
@@ -69,9 +64,9 @@ int CustomBugFix::Merge(const Json::Value& entry) {
     const int version = entry["version"].asInt();
 
     if (m_curSmallFixNumber < version) {
-        if (ReadsTrue(entry["flash_upgrade"]))
+        if (kyto::MemberBool(entry, "flash_upgrade"))
             m_blFlashUpdate = true;
-        if (ReadsTrue(entry["config_upgrade"]))
+        if (kyto::MemberBool(entry, "config_upgrade"))
             m_blConfigUpdate = true;
         if (!MergeServiceList(entry["restart"])) {
             syslog(LOG_ERR, "%s:%d failed to merge 'restart' status", kModule, __LINE__);
