@@ -12,8 +12,8 @@ int AvailableBytes(const char* path, unsigned long long& available) {
     struct statfs st;
     if (statfs(path, &st) != 0)
         return -1;
-    available = static_cast<unsigned long long>(st.f_bavail) *
-                static_cast<unsigned long long>(st.f_bsize);
+    available =
+        static_cast<unsigned long long>(st.f_bavail) * static_cast<unsigned long long>(st.f_bsize);
     return 0;
 }
 

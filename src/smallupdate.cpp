@@ -239,8 +239,8 @@ Json::Value SmallUpdate::InfoDocument(bool blPassive) const {
 
 bool SmallUpdate::InfoPackagesAreConsistent() const {
     if (m_flashUpdateDeb.empty() && m_smallUpdateDeb.empty() && m_installDebs.empty()) {
-        syslog(LOG_ERR, "%s:%d no flash and smallupdate or others debian file%s", kModule,
-               __LINE__, kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d no flash and smallupdate or others debian file%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return false;
     }
     // A package name without its link (or the reverse) means the patch list was merged
@@ -303,8 +303,8 @@ bool SmallUpdate::DumpToInfoFile(bool blPassive) {
 
 int SmallUpdate::UpdateDownloadProgress(int percentage, DOWNLOAD_STATUS status) {
     if (kyto::SetDownloadStatusKey(kyto::kKeyUpdateType, kyto::kTypeSmall, nullptr) < 0 ||
-        kyto::SetDownloadStatusNumber(kyto::kKeyPercentage, percentage,
-                                      kyto::kQuotedLineFormat) < 0 ||
+        kyto::SetDownloadStatusNumber(kyto::kKeyPercentage, percentage, kyto::kQuotedLineFormat) <
+            0 ||
         kyto::SetDownloadStatusNumber(kyto::kKeyDownloadStatus, static_cast<int>(status),
                                       kyto::kQuotedLineFormat) < 0) {
         return 0;

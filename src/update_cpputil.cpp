@@ -302,7 +302,8 @@ int UpdateUtil::GetUserAgent(std::string& agent) {
     char szMinor[16] = {0};
 
     if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "unique", szUnique, sizeof(szUnique), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get unique Fail%s", kModule, __LINE__, kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d Get unique Fail%s", kModule, __LINE__,
+               kyto::LastErrorText().c_str());
         return 0;
     }
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", szBuild, sizeof(szBuild), 0) < 0) {

@@ -173,8 +173,8 @@ int VyxUpdate::GetVyxInfo(_tag_vyxinfo_& info) {
     };
     for (const Source& src : sources) {
         if (KLIBCFileGetKeyValue(src.file, src.key, src.field, src.size, 0) < 1) {
-            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
-                   src.key, src.file, kyto::LastErrorText().c_str());
+            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, src.key,
+                   src.file, kyto::LastErrorText().c_str());
             return 0;
         }
     }
@@ -398,16 +398,16 @@ int VyxUpdate::GetRssFile() {
 
     int ret = KLIBCFileGetKeyValue(kyto::kInfoConfFile, "rss_server", server, sizeof(server), 0);
     if (ret < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
-               "rss_server", kyto::kInfoConfFile, kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, "rss_server",
+               kyto::kInfoConfFile, kyto::LastErrorText().c_str());
         return 0;
     }
     if (ret == 0)
         snprintf(server, sizeof(server), "%s", kDefaultRssServer);
 
     if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "timezone", timezone, sizeof(timezone), 0) < 1) {
-        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
-               "timezone", kyto::kInfoConfFile, kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, "timezone",
+               kyto::kInfoConfFile, kyto::LastErrorText().c_str());
         return 0;
     }
 
@@ -425,8 +425,8 @@ int VyxUpdate::GetRssFile() {
     if (command.size() > 4095)
         command.resize(4095);
     if (system(command.c_str()) != 0) {
-        syslog(LOG_ERR, "%s:%d Fail to exec command [%s]. %s", kModule, __LINE__,
-               command.c_str(), kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d Fail to exec command [%s]. %s", kModule, __LINE__, command.c_str(),
+               kyto::LastErrorText().c_str());
         return 0;
     }
     return 1;
@@ -518,7 +518,8 @@ int VyxUpdate::CheckVyxRelease() {
         char folder[4096];
         snprintf(folder, sizeof(folder), "%s", kyto::MemberText(info, "patchPath").c_str());
         std::string dir = dirname(folder);
-        if (ToNumber(kyto::MemberText(info, "buildnumber").c_str()) != ToNumber(m_release.buildNum)) {
+        if (ToNumber(kyto::MemberText(info, "buildnumber").c_str()) !=
+            ToNumber(m_release.buildNum)) {
             // The recorded image belongs to an outdated release.
             if (!CleanDownloadResult(dir)) {
                 syslog(LOG_ERR, "%s:%d Fail to clean download result", kModule, __LINE__);
@@ -651,8 +652,8 @@ int VyxUpdate::PrepareDownloadEnv(std::string& folder) {
         return 0;
     }
     if (KYTOFSMkdirP(folder.c_str(), 0700) < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to mkdir [%s]. %s", kModule, __LINE__,
-               folder.c_str(), kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d Fail to mkdir [%s]. %s", kModule, __LINE__, folder.c_str(),
+               kyto::LastErrorText().c_str());
         return 0;
     }
     return 1;
@@ -748,7 +749,7 @@ bool VyxUpdate::ExecWgetP(std::string outputPath, std::string url, bool& cancell
     // pollers), its standard output is discarded.  When the log cannot be opened wget
     // keeps this process's standard error.
     kyto::UniqueFd progress(open(kProgressLog, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
-    const char* argv[] = {kyto::kWget,          "-O",        outputPath.c_str(), url.c_str(),
+    const char* argv[] = {kyto::kWget,    "-O",        outputPath.c_str(), url.c_str(),
                           "--timeout=15", "--tries=1", "--no-dns-cache",   nullptr};
     kyto::ChildSetup setup;
     setup.program = kyto::kWget;
@@ -960,8 +961,8 @@ bool VyxUpdate::UpdateProgressFile(const char* key, const char* value) {
         return false;
     }
     if (kyto::SetDownloadStatusKey(key, value, nullptr) < 0) {
-        syslog(LOG_ERR, "%s:%d Fail to set [%s] = [%s] to [%s]. %s", kModule, __LINE__,
-               key, value, kyto::kDownloadStatusFile, kyto::LastErrorText().c_str());
+        syslog(LOG_ERR, "%s:%d Fail to set [%s] = [%s] to [%s]. %s", kModule, __LINE__, key, value,
+               kyto::kDownloadStatusFile, kyto::LastErrorText().c_str());
         return false;
     }
     return true;
@@ -1109,8 +1110,8 @@ int VyxUpdate::ReadStatusFileKeys(StatusFileKeys& keys) {
     };
     for (const KeyRead& r : reads) {
         if (KLIBCFileGetKeyValue(file, r.key, r.buf, r.size, 0) < 1) {
-            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__,
-                   r.reported, file, kyto::LastErrorText().c_str());
+            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, r.reported,
+                   file, kyto::LastErrorText().c_str());
             return -1;
         }
     }

@@ -1,4 +1,5 @@
-// Internal helpers of the platform layer: error reporting, the key=value file parser and the process runner.  Not installed.
+// Internal helpers of the platform layer: error reporting, the key=value file parser and the
+// process runner.  Not installed.
 #ifndef KYTOPLATFORM_PLATFORM_INTERNAL_H
 #define KYTOPLATFORM_PLATFORM_INTERNAL_H
 
