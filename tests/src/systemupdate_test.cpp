@@ -236,11 +236,13 @@ TEST_F(SystemUpdateTest, FullReleaseDownloadAndCancelOfEachKind) {
         RemoveTree("/volume1/@autoupdate");
         ServeFeed(full ? 5700 : 5600, 8 << 20);
         const std::string deb = ServeFix("cancelpkg", 512 << 10);
-        server->SlowPath(full ? "/img/full.img" : deb, 128 << 10);
+        const std::string slow = full ? "/img/full.img" : deb;
+        server->SlowPath(slow, 128 << 10);
+        server->ClearRequests();
         pid_t downloader = Spawn([] { return SystemUpdate().Download(); });
-        ASSERT_TRUE(WaitFor([&] {
-            return ReadKeyValueFile(kStatus)["downloadStatus"] == (full ? "downloading" : "1");
-        }));
+        // Cancel once the file is on its way (the downloader has cleared old markers then).
+        ASSERT_TRUE(WaitFor([&] { return !server->RequestsFor(slow).empty(); }));
+        EXPECT_EQ(full ? "downloading" : "1", ReadKeyValueFile(kStatus)["downloadStatus"]);
         EXPECT_EQ(1, SystemUpdate().CancelDownload());
         Wait(downloader);
         EXPECT_FALSE(PathExists(kInfo)) << "a stopped download is never recorded as done";
