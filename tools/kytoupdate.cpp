@@ -15,6 +15,7 @@
 
 #include <glob.h>
 
+#include <algorithm>
 #include <functional>
 #include <iostream>
 #include <string>
@@ -110,9 +111,9 @@ std::string KindWord(int updateType) {
 // package when a flash update is asked for.
 std::vector<std::string> DownloadLinks(const SmallUpdate& u) {
     std::vector<std::string> links = u.m_installDebLinks;
-    if (u.m_blConfigUpdate || !u.m_installDebLinks.empty())
+    if (!u.m_smallUpdateDebLink.empty() && (u.m_blConfigUpdate || !u.m_installDebLinks.empty()))
         links.push_back(u.m_smallUpdateDebLink);
-    if (u.m_blFlashUpdate)
+    if (u.m_blFlashUpdate && !u.m_flashUpdateDebLink.empty())
         links.push_back(u.m_flashUpdateDebLink);
     return links;
 }
@@ -241,8 +242,16 @@ DownloadEnd RunDownload(SystemUpdate& su) {
     }
     if (pid == 0) {
         // The cancel comes from the parent (or another kytoupdate) through the library.
+        // The download tool's own chatter would tear the display apart: the library logs
+        // to syslog, so nothing of value is lost.
         signal(SIGINT, SIG_IGN);
         signal(SIGTERM, SIG_IGN);
+        const int devNull = open("/dev/null", O_WRONLY | O_CLOEXEC);
+        if (devNull >= 0) {
+            dup2(devNull, STDOUT_FILENO);
+            dup2(devNull, STDERR_FILENO);
+            close(devNull);
+        }
         _exit(su.Download() == 1 ? 0 : 1);
     }
 
@@ -251,6 +260,8 @@ DownloadEnd RunDownload(SystemUpdate& su) {
     const double start = Now();
     bool cancelSent = false;
     int status = 0;
+    ProgressSample last;
+    last.items = vyx ? 0 : items;
     for (;;) {
         const pid_t r = waitpid(pid, &status, WNOHANG);
         if (r == pid || (r < 0 && errno != EINTR))
@@ -265,6 +276,7 @@ DownloadEnd RunDownload(SystemUpdate& su) {
         if (ReadProgress(vyx, items, folder, sample)) {
             sample.seconds = Now() - start;
             view.Update(sample);
+            last = sample;
         }
         SleepMs(200);
     }
@@ -273,10 +285,8 @@ DownloadEnd RunDownload(SystemUpdate& su) {
     UpdateUtil::CheckDownloadedPatchType(type);
     const bool complete = exitedOk && type == (vyx ? UpdateUtil::PATCH_TYPE_VYX : UpdateUtil::PATCH_TYPE_SMALL);
     if (complete) {
-        ProgressSample last;
         last.seconds = Now() - start;
         last.percentage = 100;
-        last.items = vyx ? 0 : items;
         last.item = last.items;
         view.Update(last);
     }
