@@ -1,0 +1,65 @@
+#!/usr/bin/env bash
+# The library's main job end to end on a sample appliance.  Run as root on a Debian machine:
+#
+#   bash scripts/demo.sh
+#
+# Installs the packages it needs, builds kytoupdate and the sandbox launcher in build/, then,
+# inside a disposable appliance root (build/tests/kyto-sandbox: overlay over "/", own
+# loopback network), starts a sample update server (nginx on 127.0.0.1) with a release feed,
+# a patch list and real packages, and drives a small update (check, download, status,
+# plan, apply) and then a full release (check, download) with kytoupdate.  Everything the
+# demo writes inside the appliance root vanishes with it; afterwards the host's appliance
+# paths are checked.  KYTO_DEMO_IMAGE_MB sets the release image's size (default 96),
+# KYTO_BUILD_DIR the build folder.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+ROOT=$(pwd)
+source scripts/deps.sh
+kyto_require_root
+BUILD=${KYTO_BUILD_DIR:-$ROOT/build}  # another build folder: KYTO_BUILD_DIR=/path
+
+# Appliance paths that must never appear on the host because of the demo.
+HOST_PATHS=(/autoupd@te.info /passive_upd@te.info /etc.defaults /smallupd@te /@smallupd@te_deb
+    /.upgrade_vol /usr/kyto /volume1 /srv/kyto-demo /var/run/downloadVYX.status
+    /var/run/applySmallUpd@te.status /var/run/downloadVYX.pid /var/log/kytoupdate.log
+    /var/log/dpkg_upgrade.log /var/log/kyto-calls.log)
+snapshot_host() {
+    local d p
+    for p in "${HOST_PATHS[@]}"; do
+        if [ -e "$p" ] || [ -L "$p" ]; then echo "path $p"; fi
+    done
+    for d in / /etc /run /srv /var/log /var/lib/dpkg/info /usr; do
+        find "$d" -mindepth 1 -maxdepth 1 -printf "$d/%f\n" 2>/dev/null || true
+    done
+    dpkg-query -W -f='${Package} ${Status}\n' 2>/dev/null | grep -c 'ok installed' | sed 's/^/packages /'
+}
+
+echo "== packages"
+kyto_install_packages "${KYTO_BUILD_PACKAGES[@]}" "${KYTO_TEST_PACKAGES[@]}" "${KYTO_DEMO_PACKAGES[@]}"
+BEFORE=$(snapshot_host)
+
+echo "== build kytoupdate and the sandbox launcher in $BUILD"
+cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_BUILD_TESTS=ON -DKYTO_WERROR=ON \
+    >/dev/null
+cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kyto-sandbox | grep -E '^\[100%\]|error' || true
+
+RC=0
+"$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" || RC=$?
+
+echo
+echo "== host root check"
+CHANGED=$(comm -13 <(echo "$BEFORE" | sort) <(snapshot_host | sort))
+if [ -n "$CHANGED" ]; then
+    echo "host root changed by the demo:"
+    echo "$CHANGED"
+    RC=1
+else
+    echo "host root unchanged (appliance paths, the entries of / /etc /run /srv /var/log" \
+        "/var/lib/dpkg/info /usr, the installed packages)"
+fi
+if [ $RC -eq 0 ]; then
+    echo "demo.sh: PASSED"
+else
+    echo "demo.sh: FAILED (exit $RC)"
+fi
+exit $RC
