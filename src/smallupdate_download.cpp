@@ -52,7 +52,8 @@ bool SmallUpdate::ExecWgetP(const std::string& link, const std::string& folder) 
     snprintf(output, sizeof(output), "%s/%s", folder.c_str(), link.c_str() + slash + 1);
 
     const char* argv[] = {
-        kyto::kWget, link.c_str(), "-O", output, "--timeout=15", "--tries=1", "--no-dns-cache", nullptr,
+        kyto::kWget, link.c_str(),     "-O",    output, "--timeout=15",
+        "--tries=1", "--no-dns-cache", nullptr,
     };
     const int r = KLIBCExecv(kyto::kWget, const_cast<char* const*>(argv), 1);
     if (r == 0) {

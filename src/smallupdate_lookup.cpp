@@ -80,7 +80,7 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
     const std::string base = m_conf.Def("small_info_path", kDefaultSmallInfoPath);
     if (outPath.empty()) {
         syslog(LOG_ERR, "%s:%d bad parameter", kModule, __LINE__);
-        m_errno = 3;
+        m_errno = ERROR_CODE_BAD_INPUT;
         return false;
     }
     char buildNumber[64] = {0};
@@ -88,7 +88,7 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
                              0) < 0) {
         syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
                kyto::LastErrorText().c_str());
-        m_errno = 3;
+        m_errno = ERROR_CODE_BAD_INPUT;
         return false;
     }
     const std::string url = base + "/" + buildNumber + "/" + m_unique + "/" + kPatchListName;
@@ -131,7 +131,7 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
         } else if (code != 404) {
             // 404 is the ordinary answer when nothing is published for this build and model.
             syslog(LOG_ERR, "%s:%d Error server %s", kModule, __LINE__, url.c_str());
-            m_errno = 1;
+            m_errno = ERROR_CODE_SERVER_STATUS;
         }
     }
     // A failed close (the disk filled up while the body was written) fails the fetch too.
@@ -179,7 +179,7 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
     }
     const std::string listUnique = kyto::MemberText(root, "unique");
     if (listUnique != m_unique) {
-        m_errno = 7;
+        m_errno = ERROR_CODE_OTHER_MODEL;
         syslog(LOG_ERR, "%s:%d unique not match [%s] unique in json[%s]", kModule, __LINE__,
                m_unique.c_str(), listUnique.c_str());
         return false;
@@ -204,7 +204,7 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
     const bool versionIsInt = versionValue.isConvertibleTo(Json::intValue);
     const int listBuild = versionIsInt ? versionValue.asInt() : -1;
     if (!versionIsInt || listBuild != runningBuild) {
-        m_errno = 5;
+        m_errno = ERROR_CODE_BAD_FIX_NUMBER;
         syslog(LOG_ERR, "%s:%d verison not match, original buildnumber[%d], json buildnumber[%d]",
                kModule, __LINE__, runningBuild, listBuild);
         return false;
@@ -247,10 +247,10 @@ bool SmallUpdate::LookUpServer() {
 }
 
 bool SmallUpdate::CheckHaveSmallFix() {
-    m_errno = 0;
+    m_errno = ERROR_CODE_NONE;
     if (m_newSmallFixNumber < 1) {
         syslog(LOG_ERR, "%s:%d bad version", kModule, __LINE__);
-        m_errno = 5;
+        m_errno = ERROR_CODE_BAD_FIX_NUMBER;
         return false;
     }
     const int installed = InstalledSmallFixNumber();
@@ -260,7 +260,7 @@ bool SmallUpdate::CheckHaveSmallFix() {
     if (m_newSmallFixNumber < installed) {
         syslog(LOG_ERR, "%s:%d small fix can't downgrade, org_version[%d], new_version[%d]",
                kModule, __LINE__, installed, m_newSmallFixNumber);
-        m_errno = 6;
+        m_errno = ERROR_CODE_DOWNGRADE;
         return false;
     }
     // An old apply result must not show for the new fix.
