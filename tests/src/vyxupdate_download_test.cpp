@@ -368,6 +368,8 @@ TEST_F(VyxStatusTest, CancelWithoutDownloadAndInstallerProgress) {
     EXPECT_EQ("U:30:\n", ReadFile("/tmp/update.progress"));
     EXPECT_TRUE(VyxUpdate::ReportProgress(UPDATE_STEP_R, -1, "ignored"));
     EXPECT_EQ("R:-1:\n", ReadFile("/tmp/update.progress"));
+    // A text longer than the command buffer makes a command the shell refuses, nothing more.
+    EXPECT_FALSE(VyxUpdate::ReportProgress(UPDATE_STEP_U, -1, std::string(200, 't').c_str()));
 }
 
 }  // namespace

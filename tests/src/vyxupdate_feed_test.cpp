@@ -128,6 +128,10 @@ TEST_F(VyxFeedTest, ScannerAcceptsOnlyWellFormedBoundedLinesAndKeepsTheKind) {
     EXPECT_TRUE(
         SyslogContains("Left tag [MajorVer] and right tag [MinorVer] don't match"));
     EXPECT_EQ(0x0D00, KLIBCErrGet());
+    // The longest value the scanner accepts still fits the record's field.
+    _tag_vyxinfo_ info;
+    VyxUpdate::SetVyxInfo(RSS_TAG_M_LINK, v4096.c_str(), info);
+    EXPECT_EQ(4095u, strlen(info.link));
 }
 
 // An info object of any shape is judged without throwing and without gaining members.
