@@ -42,18 +42,34 @@ namespace {
 using namespace kytoupdate;
 
 // Exit codes (kytoupdate(1)).
-constexpr int kExitOk = 0;            // done; for check: an update is available
-constexpr int kExitFailed = 1;        // the operation failed
-constexpr int kExitCannotCheck = 2;   // the update server could not be asked
-constexpr int kExitUpToDate = 3;      // no update: the system is up to date
-constexpr int kExitStopped = 4;       // the download was stopped by a cancel
-constexpr int kExitUsage = 64;        // bad command line
+constexpr int kExitOk = 0;           // done; for check: an update is available
+constexpr int kExitFailed = 1;       // the operation failed
+constexpr int kExitCannotCheck = 2;  // the update server could not be asked
+constexpr int kExitUpToDate = 3;     // no update: the system is up to date
+constexpr int kExitStopped = 4;      // the download was stopped by a cancel
+constexpr int kExitUsage = 64;       // bad command line
 
 const char* const kDebFolderName = "/@smallupd@te_deb";
 const char* const kRcFolder = "/usr/kyto/etc/rc.d";
 const char* const kAutoLock = "/var/run/kytoupdate-auto.lock";
 
 volatile sig_atomic_t g_interrupted = 0;
+
+// Owns one descriptor.
+class Fd {
+  public:
+    explicit Fd(int fd) : fd_(fd) {}
+    ~Fd() {
+        if (fd_ >= 0)
+            close(fd_);
+    }
+    Fd(const Fd&) = delete;
+    Fd& operator=(const Fd&) = delete;
+    int get() const { return fd_; }
+
+  private:
+    int fd_;
+};
 
 void OnSignal(int) {
     g_interrupted = 1;
@@ -77,7 +93,9 @@ int Fail(const std::string& text, int code = kExitFailed) {
 }
 
 void SleepMs(long ms) {
-    struct timespec ts {ms / 1000, (ms % 1000) * 1000000L};
+    struct timespec ts {
+        ms / 1000, (ms % 1000) * 1000000L
+    };
     nanosleep(&ts, nullptr);  // an interrupting signal only shortens the wait
 }
 
@@ -89,14 +107,22 @@ double Now() {
 
 std::string SmallErrnoText(int code) {
     switch (code) {
-    case 1: return "the update server answered with an error";
-    case 2: return "no volume has room for the download";
-    case 3: return "bad or unreadable update information";
-    case 4: return "the update was made for another build";
-    case 5: return "bad small-fix number, or a patch list for another build";
-    case 6: return "the update is older than the installed small fix";
-    case 7: return "the patch list is for another device model";
-    default: return "no small update";
+        case 1:
+            return "the update server answered with an error";
+        case 2:
+            return "no volume has room for the download";
+        case 3:
+            return "bad or unreadable update information";
+        case 4:
+            return "the update was made for another build";
+        case 5:
+            return "bad small-fix number, or a patch list for another build";
+        case 6:
+            return "the update is older than the installed small fix";
+        case 7:
+            return "the patch list is for another device model";
+        default:
+            return "no small update";
     }
 }
 
@@ -120,10 +146,14 @@ std::vector<std::string> DownloadLinks(const SmallUpdate& u) {
 
 const char* RestartWord(int type) {
     switch (type) {
-    case 1: return "partial";
-    case 2: return "all";
-    case 3: return "reboot";
-    default: return "none";
+        case 1:
+            return "partial";
+        case 2:
+            return "all";
+        case 3:
+            return "reboot";
+        default:
+            return "none";
     }
 }
 
@@ -139,9 +169,9 @@ std::vector<std::string> RestartScripts(const SmallUpdate& u, int type, bool& li
     } else if (type == 2) {
         std::vector<std::string> invalid;
         listReadable = SmallUpdate::GetInvalidRestartService(invalid);
-        glob_t g {};
-        if (listReadable && glob((std::string(kRcFolder) + "/S*.sh").c_str(), GLOB_ERR, nullptr,
-                                 &g) == 0) {
+        glob_t g{};
+        if (listReadable &&
+            glob((std::string(kRcFolder) + "/S*.sh").c_str(), GLOB_ERR, nullptr, &g) == 0) {
             for (size_t i = 0; i < g.gl_pathc; ++i) {
                 if (std::find(invalid.begin(), invalid.end(), g.gl_pathv[i]) == invalid.end())
                     scripts.push_back(g.gl_pathv[i]);
@@ -175,7 +205,7 @@ bool DownloadRunning() {
 
 unsigned long long FolderBytes(const std::string& folder) {
     unsigned long long total = 0;
-    glob_t g {};
+    glob_t g{};
     if (!folder.empty() && glob((folder + "/*").c_str(), 0, nullptr, &g) == 0) {
         for (size_t i = 0; i < g.gl_pathc; ++i) {
             struct stat st {};
@@ -193,14 +223,16 @@ bool ReadProgress(bool vyx, int items, const std::string& folder, ProgressSample
     if (vyx) {
         int pct = 0;
         VyxUpdate::VYX_DOWNLOAD_STATUS st = VyxUpdate::VYX_DOWNLOAD_STATUS_NONE;
-        if (!VyxUpdate::GetDownloadStatus(pct, st) || st != VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING)
+        if (!VyxUpdate::GetDownloadStatus(pct, st) ||
+            st != VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING)
             return false;
         sample.percentage = pct;
         sample.item = atoi(DownloadStatusKey("downloadNum").c_str());
         sample.items = atoi(DownloadStatusKey("downloadCount").c_str());
         struct stat fst {};
         const std::string path = DownloadStatusKey("patchPath");
-        sample.bytes = stat(path.c_str(), &fst) == 0 ? static_cast<unsigned long long>(fst.st_size) : 0;
+        sample.bytes =
+            stat(path.c_str(), &fst) == 0 ? static_cast<unsigned long long>(fst.st_size) : 0;
         return true;
     }
     int pct = 0;
@@ -246,11 +278,12 @@ DownloadEnd RunDownload(SystemUpdate& su) {
         // to syslog, so nothing of value is lost.
         signal(SIGINT, SIG_IGN);
         signal(SIGTERM, SIG_IGN);
-        const int devNull = open("/dev/null", O_WRONLY | O_CLOEXEC);
-        if (devNull >= 0) {
-            dup2(devNull, STDOUT_FILENO);
-            dup2(devNull, STDERR_FILENO);
-            close(devNull);
+        {
+            const Fd devNull(open("/dev/null", O_WRONLY | O_CLOEXEC));
+            if (devNull.get() >= 0) {
+                dup2(devNull.get(), STDOUT_FILENO);
+                dup2(devNull.get(), STDERR_FILENO);
+            }
         }
         _exit(su.Download() == 1 ? 0 : 1);
     }
@@ -283,7 +316,8 @@ DownloadEnd RunDownload(SystemUpdate& su) {
     const bool exitedOk = WIFEXITED(status) && WEXITSTATUS(status) == 0;
     UpdateUtil::PATCH_TYPE type = UpdateUtil::PATCH_TYPE_NONE;
     UpdateUtil::CheckDownloadedPatchType(type);
-    const bool complete = exitedOk && type == (vyx ? UpdateUtil::PATCH_TYPE_VYX : UpdateUtil::PATCH_TYPE_SMALL);
+    const bool complete =
+        exitedOk && type == (vyx ? UpdateUtil::PATCH_TYPE_VYX : UpdateUtil::PATCH_TYPE_SMALL);
     if (complete) {
         last.seconds = Now() - start;
         last.percentage = 100;
@@ -368,12 +402,12 @@ int CheckAndDownload(SystemUpdate& su) {
     }
     Note("downloading " + KindWord(su.m_updateType) + " " + su.GetFullVersion());
     switch (RunDownload(su)) {
-    case DownloadEnd::kStopped:
-        return Fail("the download was stopped", kExitStopped);
-    case DownloadEnd::kFailed:
-        return Fail("the download failed");
-    case DownloadEnd::kDownloaded:
-        break;
+        case DownloadEnd::kStopped:
+            return Fail("the download was stopped", kExitStopped);
+        case DownloadEnd::kFailed:
+            return Fail("the download failed");
+        case DownloadEnd::kDownloaded:
+            break;
     }
     std::string where;
     if (su.m_updateType == 1) {
@@ -529,12 +563,11 @@ int CmdPlan(bool json) {
 
 int CmdAuto() {
     // One auto-update at a time, whoever starts it (the timer, cron, a person).
-    const int lock = open(kAutoLock, O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-    if (lock < 0 || flock(lock, LOCK_EX | LOCK_NB) != 0) {
-        if (lock >= 0)
-            close(lock);
+    const Fd lock(open(kAutoLock, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    if (lock.get() < 0)
+        return Fail(std::string("cannot open ") + kAutoLock);
+    if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0)
         return Fail("another automatic update is running");
-    }
     CatchStopSignals();
     SystemUpdate su;
     int rc = CheckAndDownload(su);
@@ -549,22 +582,23 @@ int CmdAuto() {
         su.m_smallUpdate.ImportInfoFile("/autoupd@te.info");
         rc = ApplyWithServices(su.m_smallUpdate, [&su] { return su.Apply() == 1; });
     }
-    close(lock);
     return rc;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    CLI::App app{"kytoupdate: finds, downloads and installs updates of the appliance.\n"
-                 "Exit codes: 0 done (check: update available), 1 failed, 2 update server "
-                 "not reachable,\n3 up to date, 4 download stopped, 64 bad command line."};
+    CLI::App app{
+        "kytoupdate: finds, downloads and installs updates of the appliance.\n"
+        "Exit codes: 0 done (check: update available), 1 failed, 2 update server "
+        "not reachable,\n3 up to date, 4 download stopped, 64 bad command line."};
     app.require_subcommand(1, 1);
     app.set_version_flag("--version", "kytoupdate 0.1.0");
 
     app.add_subcommand("check", "Ask for an update of either kind; print its kind and version");
     app.add_subcommand("download", "Check, then download the update found, showing progress");
-    CLI::App* status = app.add_subcommand("status", "Download status of both kinds and the apply stage");
+    CLI::App* status =
+        app.add_subcommand("status", "Download status of both kinds and the apply stage");
     bool json = false, watch = false;
     double interval = 1.0;
     status->add_flag("--json", json, "Print one JSON object (one per change with --watch)");
@@ -573,17 +607,21 @@ int main(int argc, char** argv) {
         ->check(CLI::Range(0.1, 3600.0));
     app.add_subcommand("cancel", "Stop a running download (started by any process)");
     app.add_subcommand("apply", "Stop the services, apply the downloaded small update, start them");
-    CLI::App* services = app.add_subcommand("services", "Stop or start the services the downloaded small update touches");
+    CLI::App* services = app.add_subcommand(
+        "services", "Stop or start the services the downloaded small update touches");
     std::string action;
     services->add_option("ACTION", action, "stop or start")
         ->required()
         ->check(CLI::IsMember({"stop", "start"}));
-    CLI::App* import = app.add_subcommand("import", "Import a local small-update archive for apply");
+    CLI::App* import =
+        app.add_subcommand("import", "Import a local small-update archive for apply");
     std::string archive;
-    import->add_option("ARCHIVE", archive, "Patch archive (tar) holding the patch list and packages")
+    import
+        ->add_option("ARCHIVE", archive, "Patch archive (tar) holding the patch list and packages")
         ->required()
         ->check(CLI::ExistingFile);
-    CLI::App* plan = app.add_subcommand("plan", "Show what a small update would download, install and restart");
+    CLI::App* plan =
+        app.add_subcommand("plan", "Show what a small update would download, install and restart");
     bool planJson = false;
     plan->add_flag("--json", planJson, "Print one JSON object");
     app.add_subcommand("auto", "The auto-update job: check, download, apply a small update");
@@ -607,13 +645,21 @@ int main(int argc, char** argv) {
         return Fail("cannot change to /");
 
     const std::string cmd = app.get_subcommands().front()->get_name();
-    if (cmd == "check") return CmdCheck();
-    if (cmd == "download") return CmdDownload();
-    if (cmd == "status") return CmdStatus(json, watch, interval);
-    if (cmd == "cancel") return CmdCancel();
-    if (cmd == "apply") return CmdApply();
-    if (cmd == "services") return CmdServices(action);
-    if (cmd == "import") return CmdImport(archive);
-    if (cmd == "plan") return CmdPlan(planJson);
+    if (cmd == "check")
+        return CmdCheck();
+    if (cmd == "download")
+        return CmdDownload();
+    if (cmd == "status")
+        return CmdStatus(json, watch, interval);
+    if (cmd == "cancel")
+        return CmdCancel();
+    if (cmd == "apply")
+        return CmdApply();
+    if (cmd == "services")
+        return CmdServices(action);
+    if (cmd == "import")
+        return CmdImport(archive);
+    if (cmd == "plan")
+        return CmdPlan(planJson);
     return CmdAuto();
 }

@@ -12,11 +12,11 @@
 namespace kytoupdate {
 
 struct ProgressSample {
-    double seconds = 0;             // since the download started
-    int percentage = 0;             // overall, 0..100
-    int item = 0;                   // image or package being fetched, from 1 (0: not known)
-    int items = 0;                  // how many (0: not known)
-    unsigned long long bytes = 0;   // bytes on disk of the current item(s)
+    double seconds = 0;            // since the download started
+    int percentage = 0;            // overall, 0..100
+    int item = 0;                  // image or package being fetched, from 1 (0: not known)
+    int items = 0;                 // how many (0: not known)
+    unsigned long long bytes = 0;  // bytes on disk of the current item(s)
 };
 
 class ProgressView {

@@ -55,11 +55,15 @@ class KytoupdateTest : public SandboxTest {
         SandboxTest::TearDown();
     }
     void Feed(int build, const std::string& link, const std::string& md5 = "0") {
-        server->PutFile(kFeed, "<rss><channel>\n<item>\n<MajorVer>5</MajorVer>\n<MinorVer>2</MinorVer>\n"
-                               "<BuildNum>" + std::to_string(build) + "</BuildNum>\n<model>\n"
-                               "<mUnique>demo_model</mUnique>\n<mLink>" + link +
-                               "</mLink>\n<mCheckSum>" + md5 + "</mCheckSum>\n</model>\n</item>\n"
-                               "</channel></rss>\n");
+        server->PutFile(kFeed,
+                        "<rss><channel>\n<item>\n<MajorVer>5</MajorVer>\n<MinorVer>2</MinorVer>\n"
+                        "<BuildNum>" +
+                            std::to_string(build) +
+                            "</BuildNum>\n<model>\n"
+                            "<mUnique>demo_model</mUnique>\n<mLink>" +
+                            link + "</mLink>\n<mCheckSum>" + md5 +
+                            "</mCheckSum>\n</model>\n</item>\n"
+                            "</channel></rss>\n");
     }
     // Serves release 5.2-5700 with an image of the given size, sent at bytesPerSecond.
     void Release(unsigned long long bytes, long bytesPerSecond = 0) {
@@ -77,7 +81,8 @@ class KytoupdateTest : public SandboxTest {
     }
     std::string PatchList() const {
         return R"({"vyxversion":5644,"unique":"demo_model","smallupdate":[{"version":1,
-            "proj":[{"name":"kyto-tool-fix","url":")" + server->Url("/debs/" + Deb()) + R"("}],
+            "proj":[{"name":"kyto-tool-fix","url":")" +
+               server->Url("/debs/" + Deb()) + R"("}],
             "flash_upgrade":false,"config_upgrade":false,
             "restart":{"vyx_service":["S01iptables.sh"],"pkg":["DemoApp"]}}]})";
     }
@@ -168,9 +173,10 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
     EXPECT_EQ("applied VYX 5.2-5644 update 1\n", r.out);
     EXPECT_TRUE(DpkgInstalled("kyto-tool-fix"));
     EXPECT_EQ("1", ReadKeyValueFile("/etc.defaults/VERSION")["smallfixnumber"]);
-    const std::vector<std::vector<std::string>> calls = {
-        {"S01iptables.sh", "stop"}, {"kytopkg", "stop", "DemoApp"},
-        {"S01iptables.sh", "start"}, {"kytopkg", "start", "DemoApp"}};
+    const std::vector<std::vector<std::string>> calls = {{"S01iptables.sh", "stop"},
+                                                         {"kytopkg", "stop", "DemoApp"},
+                                                         {"S01iptables.sh", "start"},
+                                                         {"kytopkg", "start", "DemoApp"}};
     EXPECT_EQ(calls, RecordedCalls());
     EXPECT_FALSE(PathExists(kInfo));
     r = Cmd("status");
@@ -220,7 +226,8 @@ TEST_F(KytoupdateTest, AutoAppliesASmallUpdateAndLeavesAReleaseForTheInstaller) 
     r = Cmd("auto");
     ASSERT_EQ(0, r.rc) << r.err;
     EXPECT_NE(std::string::npos,
-              r.out.find("downloaded vyx VYX 5.2-5700 /volume1/@autoupdate/vyx.img\n")) << r.out;
+              r.out.find("downloaded vyx VYX 5.2-5700 /volume1/@autoupdate/vyx.img\n"))
+        << r.out;
     EXPECT_EQ(Md5Of(server->Root() + "/img/vyx.img"), Md5Of("/volume1/@autoupdate/vyx.img"));
     EXPECT_EQ("1", ReadKeyValueFile("/etc.defaults/VERSION")["smallfixnumber"]);
     r = Cmd("apply");  // the installer's business
@@ -268,7 +275,8 @@ TEST_F(KytoupdateTest, CancelFromASecondKytoupdateWhileAThirdWatches) {
               static_cast<char*>(nullptr));
         return 127;
     });
-    const pid_t download = Spawn([] { return Shell(Kyto() + " download >/dev/null 2>/tmp/d.err"); });
+    const pid_t download =
+        Spawn([] { return Shell(Kyto() + " download >/dev/null 2>/tmp/d.err"); });
     ASSERT_TRUE(WaitFor([] {
         const std::vector<std::string> seen = Watched();
         return std::find(seen.begin(), seen.end(), "downloading") != seen.end();
