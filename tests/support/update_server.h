@@ -68,7 +68,8 @@ class UpdateServer {
     void SlowPath(const std::string& urlPath, long bytesPerSecond);
     // Announces the whole body of urlPath but sends only its first `bytes`, then closes.
     void TruncatePath(const std::string& urlPath, long bytes);
-    // Sends the headers and the first `bytes` of urlPath, then nothing more.
+    // Sends the headers and the first `bytes` of urlPath, then nothing for a few seconds,
+    // then closes the connection.
     void StallPath(const std::string& urlPath, long bytes);
     // Every request seen so far, in arrival order.
     std::vector<Request> Requests() const;
@@ -105,6 +106,17 @@ class UpdateServerTest : public SandboxTest {
 
 // "<name>_6.1-<build>-s<fix>_all.deb": a package file name carrying a small-fix number.
 std::string SmallFixDebName(const std::string& name, int fix, int build = 5644);
+
+// One model element of a release feed item: the model's unique name, image link, MD5.
+struct FeedModel {
+    std::string unique, link, sum;
+};
+// One release feed item for major.minor build, `extra` elements (requirements) before the
+// model elements, one element per line as the update server writes them.
+std::string FeedItem(const std::string& major, const std::string& minor, const std::string& build,
+                     const std::vector<FeedModel>& models, const std::string& extra = "");
+// A whole release feed document holding the items.
+std::string FeedDocument(const std::string& items);
 
 }  // namespace kytotest
 

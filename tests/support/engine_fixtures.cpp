@@ -1,0 +1,107 @@
+// Helpers shared by the engine tests (see engine_fixtures.h).
+#include "engine_fixtures.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <kytoplatform/klibc.h>
+
+#include "vyxupdate.h"
+
+namespace kytotest {
+
+std::vector<std::vector<std::string>> DownloadNotification(bool ok) {
+    return {{"kytovyxnotify", "@administrators",
+             ok ? "update:update_download_noti_title" : "update:update_download_noti_title_err",
+             "<a style='font-size:12px;text-decoration:underline;' href=javascript:KYTO.QVS."
+             "AppLaunch('KYTO.QVS.ControlPanel.Instance',{fn:'KYTO.QVS.ControlPanel.Upgrade.Main'"
+             "})> {0} </a>",
+             "update:update_download_noti_link"}};
+}
+
+bool EventLogged(const std::string& text) {
+    return ReadFile("/var/log/kytoevent.log").value_or("").find(text) != std::string::npos;
+}
+
+void ReleaseServerTest::SetUp() {
+    SandboxTest::SetUp();
+    server = std::make_unique<UpdateServer>();
+    server->PointRssServerHere();
+    MountVolume("/volume1", 300ULL << 20);
+}
+
+void ReleaseServerTest::TearDown() {
+    server.reset();
+    SandboxTest::TearDown();
+}
+
+void ReleaseServerTest::ServeFeed(const std::vector<FeedModel>& models) {
+    server->PutFile("/autoupdate/genRSS.php", FeedDocument(FeedItem("5", "2", "5700", models)));
+}
+
+FeedModel ReleaseServerTest::Image(const std::string& unique, const std::string& urlPath,
+                                   unsigned long long bytes) {
+    return {unique, server->Url(urlPath), Md5Of(server->PutFileOfSize(urlPath, bytes))};
+}
+
+pid_t ReleaseServerTest::StartSlowDownload(unsigned long long bytes) {
+    ServeFeed({Image("demo_model", "/img/slow.img", bytes)});
+    server->SlowPath("/img/slow.img", 64 << 10);
+    pid_t pid = Spawn([] { return VyxUpdate().DownloadVyx(); });
+    struct stat st;
+    EXPECT_TRUE(WaitFor([&] {
+        return KLIBCReadPidFile("/var/run/downloadVYX.pid") > 0 &&
+               stat("/volume1/@autoupdate/slow.img", &st) == 0 && st.st_size > 0;
+    }));
+    return pid;
+}
+
+std::string BuildDebName(const DebPackage& pkg, const std::string& folder) {
+    const std::string path = BuildDeb(pkg, folder);
+    return path.substr(path.rfind('/') + 1);
+}
+
+std::tuple<int, std::string, std::string> ApplyStageSeen() {
+    int percentage = -7;
+    std::string word = "caller-stage", err = "caller-err";
+    SmallUpdate::GetApplyStage(percentage, word, err);
+    return {percentage, word, err};
+}
+
+SmallUpdate DumpableRecord() {
+    SmallUpdate u;
+    u.m_buildNumber = 5644;
+    u.m_newSmallFixNumber = 7;
+    u.m_debDir = "/volume1/d";
+    u.m_smallUpdateDeb = "smallfix_6.1-5644-s7_all.deb";
+    u.m_smallUpdateDebLink = "http://127.0.0.1/s7";
+    return u;
+}
+
+const std::string kPatchBase = "http://updates.example.invalid/smallupdate/5644/";
+
+std::string FixDeb(const std::string& package, int fix) {
+    return DebFileName(MakeDebPackage(package, SmallFixVersion("6.1", 5644, fix)));
+}
+
+Json::Value ProjJson(const std::string& name, int fix, const std::string& package) {
+    Json::Value p;
+    p["name"] = name;
+    p["url"] = kPatchBase + FixDeb(package.empty() ? name : package, fix);
+    return p;
+}
+
+Json::Value EntryJson(int version, const std::vector<Json::Value>& proj, const Json::Value& restart,
+                      bool flash, bool config) {
+    Json::Value e;
+    e["proj"] = Json::Value(Json::arrayValue);
+    for (const auto& p : proj)
+        e["proj"].append(p);
+    e["version"] = version;
+    e["flash_upgrade"] = flash;
+    e["config_upgrade"] = config;
+    e["restart"] = restart;
+    return e;
+}
+
+}  // namespace kytotest

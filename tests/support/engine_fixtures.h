@@ -1,0 +1,72 @@
+// Helpers shared by the engine tests: a reader racing a writer in another process, the
+// release-download fixture, small-update records and packages, patch-list entries as JSON.
+#ifndef KYTO_TESTS_SUPPORT_ENGINE_FIXTURES_H
+#define KYTO_TESTS_SUPPORT_ENGINE_FIXTURES_H
+
+#include <sys/types.h>
+
+#include <functional>
+#include <memory>
+#include <string>
+#include <tuple>
+#include <vector>
+
+#include <json/json.h>
+
+#include "deb_builder.h"
+#include "sandbox.h"
+#include "smallupdate.h"
+#include "update_server.h"
+
+namespace kytotest {
+
+// ---- Release download --------------------------------------------------------------------
+
+// The notification the release download sends to the administrators when it ends.
+std::vector<std::vector<std::string>> DownloadNotification(bool ok);
+// True when the appliance's event log holds the text.
+bool EventLogged(const std::string& text);
+
+// A loopback update server that the release feed points at (stopped before the sandbox's
+// own checks) and a 300 MiB data volume at /volume1.
+class ReleaseServerTest : public SandboxTest {
+  protected:
+    void SetUp() override;
+    void TearDown() override;
+    // Publishes one feed item, 5.2 build 5700, holding the models.
+    void ServeFeed(const std::vector<FeedModel>& models);
+    // Serves an image of `bytes` at urlPath; returns the feed entry for it with its MD5.
+    FeedModel Image(const std::string& unique, const std::string& urlPath,
+                    unsigned long long bytes);
+    // Serves a slow image for this model and starts its download in a second process;
+    // returns once wget runs and bytes have arrived in /volume1/@autoupdate/slow.img.
+    pid_t StartSlowDownload(unsigned long long bytes);
+    std::unique_ptr<UpdateServer> server;
+};
+
+// ---- Small update ------------------------------------------------------------------------
+
+// Builds the package into folder and returns its file name.
+std::string BuildDebName(const DebPackage& pkg, const std::string& folder);
+// What SmallUpdate::GetApplyStage reports, starting from the caller's own values
+// -7, "caller-stage" and "caller-err".
+std::tuple<int, std::string, std::string> ApplyStageSeen();
+// A record for build 5644, fix 7, that dumps cleanly: one small-update package with its link,
+// package folder "/volume1/d".
+SmallUpdate DumpableRecord();
+
+// ---- Patch-list entries as JSON ----------------------------------------------------------
+
+// Where the entries' packages are "served": "http://updates.example.invalid/smallupdate/5644/".
+extern const std::string kPatchBase;
+// "<package>_6.1-5644-s<fix>_all.deb".
+std::string FixDeb(const std::string& package, int fix);
+// {"name": name, "url": kPatchBase + FixDeb(package or name, fix)}
+Json::Value ProjJson(const std::string& name, int fix, const std::string& package = "");
+// One patch-list entry with every key the merge needs.
+Json::Value EntryJson(int version, const std::vector<Json::Value>& proj,
+                      const Json::Value& restart = "none", bool flash = false, bool config = false);
+
+}  // namespace kytotest
+
+#endif
