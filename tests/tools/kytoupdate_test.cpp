@@ -110,9 +110,13 @@ TEST_F(KytoupdateTest, BadArgumentsAndHelp) {
 }
 
 TEST_F(KytoupdateTest, CheckTellsKindVersionOrWhyNot) {
-    Result r = Cmd("check");  // feed without anything newer, no patch list (404)
-    EXPECT_EQ(3, r.rc);
-    EXPECT_EQ("none\n", r.out);
+    for (const char* cmd : {"check", "download", "plan"}) {  // nothing newer, no patch list
+        const Result r = Cmd(cmd);
+        EXPECT_EQ(3, r.rc) << cmd;
+        EXPECT_EQ("none\n", r.out) << cmd;
+    }
+    Result r = Cmd("cancel");  // nothing runs
+    EXPECT_EQ(1, r.rc);
     SmallFix();
     r = Cmd("check");
     EXPECT_EQ(0, r.rc) << r.err;
