@@ -137,9 +137,9 @@ std::string KindWord(int updateType) {
 // package when a flash update is asked for.
 std::vector<std::string> DownloadLinks(const SmallUpdate& u) {
     std::vector<std::string> links = u.m_installDebLinks;
-    if (!u.m_smallUpdateDebLink.empty() && (u.m_blConfigUpdate || !u.m_installDebLinks.empty()))
+    if (u.m_blConfigUpdate || !u.m_installDebLinks.empty())
         links.push_back(u.m_smallUpdateDebLink);
-    if (u.m_blFlashUpdate && !u.m_flashUpdateDebLink.empty())
+    if (u.m_blFlashUpdate)
         links.push_back(u.m_flashUpdateDebLink);
     return links;
 }

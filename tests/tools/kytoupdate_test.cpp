@@ -72,17 +72,22 @@ class KytoupdateTest : public SandboxTest {
             server->SlowPath("/img/vyx.img", bytesPerSecond);
         Feed(5700, server->Url("/img/vyx.img"), md5);
     }
-    // Publishes fix 1: one package, restarting S01iptables.sh and the add-on "DemoApp".
+    // Publishes fix 1: a further package and the small-update package, restarting
+    // S01iptables.sh and the add-on "DemoApp".
     void SmallFix() {
         DebPackage pkg = MakeDebPackage("kyto-tool-fix", SmallFixVersion("1.0", 5644, 1));
         pkg.files["/usr/share/kyto-tool-fix/x"] = "x\n";
         BuildDeb(pkg, server->Root() + "/debs");
+        BuildDeb(MakeDebPackage("kyto-su", SmallFixVersion("5.2", 5644, 1)),
+                 server->Root() + "/debs");
         server->PutFile(UpdateServer::PatchListPath(5644, "demo_model"), PatchList());
     }
     std::string PatchList() const {
         return R"({"vyxversion":5644,"unique":"demo_model","smallupdate":[{"version":1,
             "proj":[{"name":"kyto-tool-fix","url":")" +
-               server->Url("/debs/" + Deb()) + R"("}],
+               server->Url("/debs/" + Deb()) + R"("},
+                    {"name":"smallupdate","url":")" +
+               server->Url("/debs/kyto-su_5.2-5644-s1_all.deb") + R"("}],
             "flash_upgrade":false,"config_upgrade":false,
             "restart":{"vyx_service":["S01iptables.sh"],"pkg":["DemoApp"]}}]})";
     }
@@ -142,7 +147,7 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
     Result r = Cmd("download");
     ASSERT_EQ(0, r.rc) << r.err;
     // Not a terminal: plain lines, the last one tells what was downloaded.
-    EXPECT_NE(std::string::npos, r.out.find("100%  package 1 of 1")) << r.out;
+    EXPECT_NE(std::string::npos, r.out.find("100%  package 2 of 2")) << r.out;
     EXPECT_NE(std::string::npos, r.out.find("downloaded smallupdate VYX 5.2-5644 update 1\n"));
     EXPECT_EQ(std::string::npos, r.out.find('\r'));
     EXPECT_TRUE(PathExists(kInfo));
@@ -161,6 +166,7 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
     ASSERT_EQ(0, r.rc) << r.err;
     Json::Value plan = ParseJson(r.out);
     EXPECT_EQ("VYX 5.2-5644 update 1", plan["version"].asString());
+    ASSERT_EQ(2u, plan["download"].size());
     EXPECT_EQ(server->Url("/debs/" + Deb()), plan["download"][0].asString());
     EXPECT_EQ(Deb(), plan["install"][0].asString());
     EXPECT_EQ("partial", plan["restart"].asString());
