@@ -54,7 +54,11 @@ BEFORE=$(snapshot_host)
 echo "== build kytoupdate and the sandbox launcher in $BUILD"
 cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_BUILD_TESTS=ON -DKYTO_WERROR=ON \
     >/dev/null
-cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kyto-sandbox | grep -E '^\[100%\]|error' || true
+if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kyto-sandbox >"$BUILD/demo-build.log" 2>&1; then
+    tail -n 30 "$BUILD/demo-build.log"
+    echo "demo.sh: FAILED (build; log: $BUILD/demo-build.log)"
+    exit 1
+fi
 
 RC=0
 "$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" || RC=$?
