@@ -100,13 +100,15 @@ bool SmallUpdate::DownloadFiles(bool& stopped) {
         goto FAIL;
     }
 
-    // The small-update package is fetched only together with a configuration update or
-    // further packages.
+    // The small-update package carries the configuration updater and the boot-time
+    // installer, so it is fetched only together with a configuration update or further
+    // packages.  The links are taken as the record has them: a record that asks for a
+    // package without a link fails the download rather than applying half an update.
     links = m_installDebLinks;
-    if (!m_smallUpdateDebLink.empty() && (m_blConfigUpdate || !m_installDebLinks.empty())) {
+    if (m_blConfigUpdate || !m_installDebLinks.empty()) {
         links.push_back(m_smallUpdateDebLink);
     }
-    if (m_blFlashUpdate && !m_flashUpdateDebLink.empty()) {
+    if (m_blFlashUpdate) {
         links.push_back(m_flashUpdateDebLink);
     }
 

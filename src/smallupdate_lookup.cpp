@@ -34,14 +34,6 @@ constexpr const char* kModule = "smallupdate";
 constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
 constexpr const char* kPatchListName = "VYX-Security.json";
 
-// A patch list is a few kilobytes: a server that does not connect within this time, or
-// sends nothing for kLowSpeedSeconds, or has not finished after kTransferSeconds, is
-// treated as a failed transfer instead of blocking the caller (the interface's check, the
-// scheduled job) for good.
-constexpr long kConnectSeconds = 15;
-constexpr long kLowSpeedSeconds = 15;
-constexpr long kTransferSeconds = 60;
-
 // libcurl's global state is set up once per process, before the first handle.  It is
 // never torn down: the library may be unloaded while its host still uses libcurl.
 void InitCurlOnce() {
@@ -106,21 +98,18 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
     }
 
     // The body goes straight into the file through libcurl's default writer.  Redirects
-    // are not followed.  No signals: the caller may be a threaded program.
+    // are not followed and no time-out is set: the appliance's own check waits for the
+    // server as long as the connection lives.  The error buffer only feeds the log.
     char errorText[CURL_ERROR_SIZE] = {0};
     curl_easy_setopt(curl.get(), CURLOPT_URL, url.c_str());
     curl_easy_setopt(curl.get(), CURLOPT_WRITEDATA, out.get());
     curl_easy_setopt(curl.get(), CURLOPT_ERRORBUFFER, errorText);
-    curl_easy_setopt(curl.get(), CURLOPT_NOSIGNAL, 1L);
-    curl_easy_setopt(curl.get(), CURLOPT_CONNECTTIMEOUT, kConnectSeconds);
-    curl_easy_setopt(curl.get(), CURLOPT_LOW_SPEED_LIMIT, 1L);
-    curl_easy_setopt(curl.get(), CURLOPT_LOW_SPEED_TIME, kLowSpeedSeconds);
-    curl_easy_setopt(curl.get(), CURLOPT_TIMEOUT, kTransferSeconds);
 
     bool ok = false;
     const CURLcode rc = curl_easy_perform(curl.get());
     if (rc != CURLE_OK) {
-        syslog(LOG_ERR, "%s:%d failed to exec curl command (%s)", kModule, __LINE__,
+        syslog(LOG_ERR, "%s:%d failed to exec curl command", kModule, __LINE__);
+        syslog(LOG_ERR, "%s:%d %s", kModule, __LINE__,
                errorText[0] ? errorText : curl_easy_strerror(rc));
     } else {
         // A failed query of the code leaves 200: the transfer itself succeeded.

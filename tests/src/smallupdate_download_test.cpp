@@ -38,21 +38,28 @@ class SmallUpdateDownloadTest : public UpdateServerTest {
         u.m_buildNumber = 5644;
         u.m_blRestartAllService = true;
     }
-    // Serves further packages of 48 KiB each and puts them into the record.
+    // Serves further packages of 48 KiB each, and the small-update package that comes with
+    // them (fetched last), and puts them into the record.
     void Packages(const std::vector<std::string>& names, long bytesPerSecond = 0) {
-        for (const std::string& name : names) {
+        std::vector<std::string> all = names;
+        all.push_back("small" + names.front());
+        for (const std::string& name : all) {
             server->PutFileOfSize("/debs/" + Deb(name), 48 << 10);
             if (bytesPerSecond)
                 server->SlowPath("/debs/" + Deb(name), bytesPerSecond);
+        }
+        for (const std::string& name : names) {
             u.m_installDebs.push_back(Deb(name));
             u.m_installDebLinks.push_back(server->Url("/debs/" + Deb(name)));
         }
+        u.m_smallUpdateDeb = Deb(all.back());
+        u.m_smallUpdateDebLink = server->Url("/debs/" + Deb(all.back()));
     }
     SmallUpdate u;
 };
 
 TEST_F(SmallUpdateDownloadTest, PollerInAnotherProcessSeesEveryFileAndThenTheInfoFile) {
-    Packages({"pa", "pb", "pc"}, 192 << 10);
+    Packages({"pa", "pb"}, 192 << 10);
     const pid_t poller = Spawn([] {
         std::string seen, last, now;
         for (int i = 0; i < 30000 && now != "100 finished"; ++i, usleep(2000)) {
@@ -73,19 +80,19 @@ TEST_F(SmallUpdateDownloadTest, PollerInAnotherProcessSeesEveryFileAndThenTheInf
         at = polled.find(state, at);
         ASSERT_NE(std::string::npos, at) << state << " missing in order from\n" << polled;
     }
-    EXPECT_EQ((std::vector<std::string>{Deb("pa"), Deb("pb"), Deb("pc")}), ListDir(kDir));
+    EXPECT_EQ((std::vector<std::string>{Deb("pa"), Deb("pb"), Deb("smallpa")}), ListDir(kDir));
     EXPECT_FALSE(PathExists(kStatus)) << "a finished download is told by the info file";
 }
 
 TEST_F(SmallUpdateDownloadTest, RetriesAreCountedAndTheTenthFailureEndsTheDownload) {
-    Packages({"ra", "rb", "rc"});
+    Packages({"ra", "rb"});
     server->FailPath("/debs/" + Deb("ra"), 500, 3);
     server->FailPath("/debs/" + Deb("rb"), 503);
     ClearSyslog();
     EXPECT_FALSE(u.Download(true));
     EXPECT_EQ(4u, server->RequestsFor("/debs/" + Deb("ra")).size());
     EXPECT_EQ(10u, server->RequestsFor("/debs/" + Deb("rb")).size());
-    EXPECT_TRUE(server->RequestsFor("/debs/" + Deb("rc")).empty());
+    EXPECT_TRUE(server->RequestsFor("/debs/" + Deb("smallra")).empty());
     EXPECT_EQ("33 failed", Status()) << "the percentage of the last completed file";
     EXPECT_FALSE(PathExists(kDir) || PathExists(kInfo));
     EXPECT_TRUE(SyslogContains("failed to exec cmd=[/usr/kyto/bin/wget " + u.m_installDebLinks[1] +
@@ -112,12 +119,11 @@ TEST_F(SmallUpdateDownloadTest, StopMarkerBeforeBetweenAndAfterFiles) {
         u.m_installDebs.clear();
         u.m_installDebLinks.clear();
         const std::string tag = std::to_string(when);
-        Packages(when == kAfter ? std::vector<std::string>{"last" + tag}
-                                : std::vector<std::string>{"a" + tag, "b" + tag, "c" + tag},
-                 when == kBefore ? 0 : 96 << 10);
+        Packages({"a" + tag, "b" + tag}, when == kBefore ? 0 : 96 << 10);
         if (when == kBefore)
             WriteFile(kMarker, "");
-        const std::string first = kDir + "/" + u.m_installDebs[0];
+        const std::string first =
+            kDir + "/" + (when == kAfter ? u.m_smallUpdateDeb : u.m_installDebs[0]);
         const pid_t canceller = Spawn([&] {
             return when == kBefore || (WaitFor([&] { return PathExists(first); }) &&
                                        SmallUpdate().CancelDownload())
@@ -129,8 +135,8 @@ TEST_F(SmallUpdateDownloadTest, StopMarkerBeforeBetweenAndAfterFiles) {
         EXPECT_FALSE(PathExists(kStatus));
         EXPECT_EQ(when == kBefore, PathExists(kInfo));
         EXPECT_EQ(when == kAfter, PathExists(kMarker));
-        EXPECT_EQ(when == kBetween ? 1u : u.m_installDebs.size(), server->Requests().size());
-        EXPECT_EQ(when == kBetween ? 0u : u.m_installDebs.size(), ListDir(kDir).size());
+        EXPECT_EQ(when == kBetween ? 1u : 3u, server->Requests().size());
+        EXPECT_EQ(when == kBetween ? 0u : 3u, ListDir(kDir).size());
         Shell("rm -f /tmp/stop_download_smallfix /autoupd@te.info");
     }
 }

@@ -46,7 +46,8 @@ class SystemUpdateTest : public UpdateServerTest {
                                    "</mCheckSum>\n</model>\n</item>\n</channel></rss>\n");
     }
     // A patch list offering fix 5: one real package (with `payload` incompressible bytes) to
-    // install and a restart of S20samba.sh.  Returns the package's URL path.
+    // install, its small-update package and a restart of S20samba.sh.  Returns the package's
+    // URL path.
     std::string ServeFix(const std::string& pkg = "facadepkg", size_t payload = 0) {
         DebPackage deb = MakeDebPackage(pkg, SmallFixVersion("6.1", 5644, 5));
         std::string blob(payload, '\0');
@@ -58,8 +59,14 @@ class SystemUpdateTest : public UpdateServerTest {
         deb.files["/usr/share/" + pkg + "/blob"] = blob;
         const std::string path = "/d/" + DebFileName(deb);
         BuildDeb(deb, server->Root() + "/d");
+        const std::string small = "/d/" + SmallFixDebName("small" + pkg, 5);
+        server->PutFile(small, "only unpacked for configuration or reboot updates");
         server->PutFile(kList, PatchListJson(5644, "demo_model",
-                                             {{5, {{pkg, server->Url(path)}}, false, false,
+                                             {{5,
+                                               {{pkg, server->Url(path)},
+                                                {"smallupdate", server->Url(small)}},
+                                               false,
+                                               false,
                                                "{\"vyx_service\":[\"S20samba.sh\"],\"pkg\":[]}"}}));
         return path;
     }
@@ -239,7 +246,8 @@ TEST_F(SystemUpdateTest, FullReleaseDownloadAndCancelOfEachKind) {
         EXPECT_EQ(1, SystemUpdate().CancelDownload());
         Wait(downloader);
         EXPECT_FALSE(PathExists(kInfo)) << "a stopped download is never recorded as done";
-        EXPECT_EQ(!full, PathExists(kStop)) << "the small downloader leaves its marker at the end";
+        // The small downloader obeys before its next file: marker and package folder go.
+        EXPECT_FALSE(PathExists(kStop) || PathExists("/volume1/@smallupd@te_deb"));
         EXPECT_FALSE(full && ReadKeyValueFile(kStatus)["downloadStatus"] == "downloading");
     }
 }

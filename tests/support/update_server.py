@@ -11,7 +11,7 @@ ignored when a path is matched).  Two files in ROOT steer it:
                  {"fail": {"/path": {"status": 503, "times": 2}},   # times < 0: always
                   "slow": {"/path": 4096},                          # bytes per second
                   "truncate": {"/path": 10},   # send 10 body bytes, then close
-                  "stall": {"/path": 10}}      # send 10 body bytes, then nothing
+                  "stall": {"/path": 10}}      # send 10 body bytes, hang, then close
   .requests.log  one JSON object per request, appended before the answer is sent:
                  {"method", "path", "query", "user_agent", "status"}
 
@@ -32,7 +32,7 @@ from http.server import BaseHTTPRequestHandler, ThreadingHTTPServer
 CONTROL = ".control.json"
 REQUEST_LOG = ".requests.log"
 BLOCK = 1 << 16
-STALL_SECONDS = 600  # longer than any client time-out; the server dies with its test
+STALL_SECONDS = 3  # a hung server that finally drops the connection
 
 _lock = threading.Lock()
 
