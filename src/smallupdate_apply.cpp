@@ -23,88 +23,85 @@ namespace {
 constexpr const char* kModule = "smallupdate";
 constexpr const char* kErrSystem = "err_system";
 
+// The steps of one apply up to the new small-fix number.  `percentage` and `stage` follow
+// what the poller was last shown, so that a failure can be reported where it happened.
+bool RunApplySteps(SmallUpdate& update, int& percentage, SmallUpdate::APPLY_STAGE& stage) {
+    SmallUpdate::UpdateApplyProgress(0, SmallUpdate::APPLY_STAGE_ANALYING, "");
+    // A record loaded by the caller skips this check on purpose.
+    if (update.m_newSmallFixNumber < 0 && !update.IsReadyApply())
+        return false;
+
+    char installed[8] = {0};
+    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", installed, sizeof(installed),
+                             0) <= 0)
+        snprintf(installed, sizeof(installed), "%s", "0");
+    std::ostringstream line;
+    line << "start critical update to buildnumber: " << update.m_buildNumber
+         << " original smallfixnumbre: " << installed
+         << " new_smallfixnumber: " << update.m_newSmallFixNumber;
+    DebianLib::WriteUpdateLog(line.str(), kyto::kUpdateLog);
+
+    stage = SmallUpdate::APPLY_STAGE_PROGRAM;
+    SmallUpdate::UpdateApplyProgress(0, stage, "");
+    if (update.m_blFlashUpdate && !update.UpdateFlash()) {
+        syslog(LOG_ERR, "%s:%d failed to update flash", kModule, __LINE__);
+        return false;
+    }
+    SmallUpdate::UpdateApplyProgress(percentage = 10, stage, "");
+
+    // The small-update package carries the configuration updater and the boot-time
+    // installer: it is unpacked for a configuration update, and for a reboot update that
+    // stages further packages.
+    const bool unpack =
+        update.m_blConfigUpdate || (update.m_blNeedReboot && !update.m_installDebs.empty());
+    if (unpack && !update.UnpackSmallUpdate()) {
+        syslog(LOG_ERR, "%s:%d failed to unpack smakkupdate debian", kModule, __LINE__);
+        return false;
+    }
+    SmallUpdate::UpdateApplyProgress(percentage = 20, stage, "");
+
+    if (update.m_blConfigUpdate && !update.UpdateConfig()) {
+        syslog(LOG_ERR, "%s:%d failed to do config update", kModule, __LINE__);
+        return false;
+    }
+    SmallUpdate::UpdateApplyProgress(percentage = 30, stage, "");
+    if (!update.InstallDeb(30, stage)) {
+        syslog(LOG_ERR, "%s:%d failed to do install debain action", kModule, __LINE__);
+        return false;
+    }
+
+    // Written only once every package is in: a failure here leaves the old number, and the
+    // next check offers the fix again.
+    char fix[8] = {0};
+    snprintf(fix, sizeof(fix), "%d", update.m_newSmallFixNumber);
+    return KLIBCFileSetKeyValue(kyto::kVersionFile, "smallfixnumber", fix, nullptr) > 0;
+}
+
 }  // namespace
 
 bool SmallUpdate::Apply() {
-    // What the failure report repeats: the last percentage and stage shown.
     int percentage = 0;
     APPLY_STAGE stage = APPLY_STAGE_ANALYING;
-    bool ok = false;
-
-    UpdateApplyProgress(0, APPLY_STAGE_ANALYING, "");
-    // A record loaded by the caller skips this check on purpose.
-    if (m_newSmallFixNumber < 0 && !IsReadyApply()) {
-        goto REPORT;
-    }
-    {
-        char installed[8] = {0};
-        if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", installed, sizeof(installed),
-                                 0) <= 0) {
-            snprintf(installed, sizeof(installed), "%s", "0");
-        }
-        std::ostringstream line;
-        line << "start critical update to buildnumber: " << m_buildNumber
-             << " original smallfixnumbre: " << installed
-             << " new_smallfixnumber: " << m_newSmallFixNumber;
-        DebianLib::WriteUpdateLog(line.str(), kyto::kUpdateLog);
-    }
-    stage = APPLY_STAGE_PROGRAM;
-    UpdateApplyProgress(0, APPLY_STAGE_PROGRAM, "");
-
-    if (m_blFlashUpdate && !UpdateFlash()) {
-        syslog(LOG_ERR, "%s:%d failed to update flash", kModule, __LINE__);
-        goto REPORT;
-    }
-    UpdateApplyProgress(10, APPLY_STAGE_PROGRAM, "");
-    percentage = 10;
-
-    if ((m_blConfigUpdate || (m_blNeedReboot && !m_installDebs.empty())) && !UnpackSmallUpdate()) {
-        syslog(LOG_ERR, "%s:%d failed to unpack smakkupdate debian", kModule, __LINE__);
-        goto REPORT;
-    }
-    UpdateApplyProgress(20, APPLY_STAGE_PROGRAM, "");
-    percentage = 20;
-
-    if (m_blConfigUpdate && !UpdateConfig()) {
-        syslog(LOG_ERR, "%s:%d failed to do config update", kModule, __LINE__);
-        goto REPORT;
-    }
-    UpdateApplyProgress(30, APPLY_STAGE_PROGRAM, "");
-    percentage = 30;
-    if (!InstallDeb(30, APPLY_STAGE_PROGRAM)) {
-        syslog(LOG_ERR, "%s:%d failed to do install debain action", kModule, __LINE__);
-        goto REPORT;
-    }
-
-    {
-        char fix[8] = {0};
-        snprintf(fix, sizeof(fix), "%d", m_newSmallFixNumber);
-        if (KLIBCFileSetKeyValue(kyto::kVersionFile, "smallfixnumber", fix, nullptr) <= 0) {
-            goto REPORT;
-        }
-    }
-
-    if (!m_blNeedReboot && !KYTOHAIsRunning()) {
+    const bool ok = RunApplySteps(*this, percentage, stage);
+    if (!ok) {
+        UpdateApplyProgress(percentage, stage, kErrSystem);
+    } else if (!m_blNeedReboot && !KYTOHAIsRunning()) {
         // The status stays at the last package's percentage; the service start moves it on.
         DebianLib::WriteUpdateLog("Finished update!", kyto::kUpdateLog);
     } else {
+        // A cluster node is restarted by the cluster's own upgrade, like a reboot update.
         UpdateApplyProgress(100, APPLY_STAGE_REBOOT, "");
         DebianLib::WriteUpdateLog("Finished update before reboot!", kyto::kUpdateLog);
     }
-    ok = true;
-    goto CLEANUP;
 
-REPORT:
-    UpdateApplyProgress(percentage, stage, kErrSystem);
-
-CLEANUP : {
+    // Every apply, successful or not, consumes the downloaded packages and the info files,
+    // so that a broken download is never applied twice.
     char passiveDir[4095] = {0};
     if (KLIBCFileGetKeyValue(kyto::kPassiveInfoFile, "debDir", passiveDir, sizeof(passiveDir), 0) >
         0) {
         UpdateUtil::RemoveFolder(passiveDir);
         unlink(kyto::kPassiveInfoFile);
     }
-}
     UpdateUtil::RemoveFolder(m_debDir);
     unlink(kyto::kAutoUpdateInfoFile);
     return ok;
