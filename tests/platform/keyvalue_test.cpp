@@ -118,14 +118,14 @@ TEST_F(KeyValueTest, ReaderInAnotherProcessNeverSeesATornOrMissingFile) {
     auto write = [&](int i) {
         return KLIBCFileSetKeyValue(kFile, "value", i % 2 ? "s" : longValue.c_str(), nullptr) == 1;
     };
-    EXPECT_EQ(0, RaceReaderAgainstWriter(3000, write, [&] {
-                  std::vector<char> buf(8192);
-                  int n = KLIBCFileGetKeyValue(kFile, "value", buf.data(), buf.size(), 0);
-                  if (n < 0 || (std::string(buf.data()) != "s" && buf.data() != longValue))
-                      return 1;
-                  return KLIBCFileGetKeyValue(kFile, "after", buf.data(), buf.size(), 0) == 1 ? 0
-                                                                                              : 2;
-              }));
+    auto check = [&] {
+        std::vector<char> buf(8192);
+        int n = KLIBCFileGetKeyValue(kFile, "value", buf.data(), buf.size(), 0);
+        if (n < 0 || (std::string(buf.data()) != "s" && buf.data() != longValue))
+            return 1;
+        return KLIBCFileGetKeyValue(kFile, "after", buf.data(), buf.size(), 0) == 1 ? 0 : 2;
+    };
+    EXPECT_EQ(0, RaceReaderAgainstWriter(3000, write, check));
     EXPECT_EQ(ListDir("/tmp/kv"), Names{"test.conf"});
 }
 

@@ -2,6 +2,7 @@
 // and the work steps with real packages and the real package tool: flash updater, unpack
 // into the staging folder, installation in small-fix order with progress, and staging for
 // the next boot.
+#include <stdlib.h>
 #include <unistd.h>
 
 #include "engine_fixtures.h"
@@ -12,32 +13,10 @@ using namespace kytotest;
 const std::string kDebDir = "/volume1/@smallupd@te_deb";
 const char *kStaging = "/smallupd@te/", *kApplyStatus = "/var/run/applySmallUpd@te.status",
            *kOrderLog = "/tmp/install_order.log";
-const char* const kWords[] = {
-    "none",  "waiting_remote_upgrading", "analying", "program", "startService", "finished",
-    "reboot"};
-
-// Builds a package of small fix `fix` into the download folder and returns its file name.
-// Its postinst logs its name and the apply percentage it sees (written after the previous
-// package); a failing one exits 1 instead; `files` are shipped as they are.
-std::string Deb(const std::string& name, int fix, bool fails = false,
-                const std::map<std::string, std::string>& files = {}) {
-    DebPackage pkg = fails ? FailingDeb(name, SmallFixVersion("6.1", 5644, fix))
-                           : MakeDebPackage(name, SmallFixVersion("6.1", 5644, fix));
-    if (!fails && files.empty()) {
-        pkg.postinst = "#!/bin/sh\necho " + name + " $(sed -n 's/^percentage=\"\\(.*\\)\"/\\1/p' " +
-                       kApplyStatus + ") >> " + kOrderLog + "\n";
-    }
-    pkg.files = files;
-    return BuildDebName(pkg, kDebDir);
-}
-
-bool TempFilesLeft() {
-    for (const auto& name : ListDir("/var/run")) {
-        if (name.rfind("applySmallUpd@te.status_", 0) == 0)
-            return true;
-    }
-    return false;
-}
+// clang-format off
+const char* const kWords[] = {"none", "waiting_remote_upgrading", "analying", "program",
+                              "startService", "finished", "reboot"};
+// clang-format on
 
 class SmallUpdateApplyTest : public SandboxTest {
   protected:
@@ -51,41 +30,33 @@ class SmallUpdateApplyTest : public SandboxTest {
 
 TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
     ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(53, SmallUpdate::APPLY_STAGE_PROGRAM, "a b"));
-    EXPECT_EQ("percentage=\"53\"\nstage=\"3\"\nErrMsg=\"a b\"\n",
-              ReadFile(kApplyStatus).value_or(""));
+    EXPECT_EQ("percentage=\"53\"\nstage=\"3\"\nErrMsg=\"a b\"\n", ReadFile(kApplyStatus));
     // A value the key=value writer refuses: the old file stays, no temporary file is left.
     EXPECT_FALSE(SmallUpdate::UpdateApplyProgress(99, SmallUpdate::APPLY_STAGE_REBOOT, "x\ny"));
-    EXPECT_EQ("53", ReadKeyValueFile(kApplyStatus)["percentage"]);
-    EXPECT_FALSE(TempFilesLeft());
+    EXPECT_EQ("53 program a b", ApplyStageSeen());
+    EXPECT_FALSE(AnyEntryStartsWith("/var/run", "applySmallUpd@te.status_"));
     SmallUpdate().HASetApplyProgressErr("peer upgrading");
-    EXPECT_EQ(std::make_tuple(0, std::string(kWords[1]), std::string("peer upgrading")),
-              ApplyStageSeen());
-
+    EXPECT_EQ("0 waiting_remote_upgrading peer upgrading", ApplyStageSeen());
     // Every stage has its word; an empty ErrMsg leaves the caller's text.
     for (int stage = 0; stage <= 6; ++stage) {
-        ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(
-            stage * 10, static_cast<SmallUpdate::APPLY_STAGE>(stage), ""));
-        EXPECT_EQ(
-            std::make_tuple(stage * 10, std::string(kWords[stage]), std::string("caller-err")),
-            ApplyStageSeen());
+        ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(stage, SmallUpdate::APPLY_STAGE(stage), ""));
+        EXPECT_EQ(std::to_string(stage) + " " + kWords[stage] + " caller-err", ApplyStageSeen());
     }
     // Files written by others, missing (nullptr) or incomplete.  Stages beyond the table
     // (negative ones too) keep the caller's word and report an error.
     // clang-format off
-    struct Row { const char* content; int percentage; const char *word, *err; } rows[] = {
-        {"percentage=\"40\"\nstage=\"7\"\nErrMsg=\"\"\n", 40, "caller-stage", "err_system"},
-        {"percentage=\"40\"\nstage=\"-1\"\n", 40, "caller-stage", "err_system"},
-        {"percentage=\"40\"\nstage=\"9\"\nErrMsg=\"disk full\"\n", 40, "caller-stage", "disk full"},
-        {nullptr, -7, "none", "caller-err"}, {"stage=\"3\"\nErrMsg=\"\"\n", -7, "none", "err_system"},
-        {"percentage=\"30\"\n", -7, "none", "err_system"}};
+    const std::pair<const char*, const char*> rows[] = {
+        {"percentage=\"40\"\nstage=\"7\"\nErrMsg=\"\"\n", "40 caller-stage err_system"},
+        {"percentage=\"40\"\nstage=\"-1\"\n", "40 caller-stage err_system"},
+        {"percentage=\"40\"\nstage=\"9\"\nErrMsg=\"disk full\"\n", "40 caller-stage disk full"},
+        {nullptr, "-7 none caller-err"}, {"stage=\"3\"\nErrMsg=\"\"\n", "-7 none err_system"},
+        {"percentage=\"30\"\n", "-7 none err_system"}};
     // clang-format on
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.content ? row.content : "(no file)");
+    for (const auto& [content, seen] : rows) {
         RemoveTree(kApplyStatus);
-        if (row.content)
-            WriteFile(kApplyStatus, row.content);
-        EXPECT_EQ(std::make_tuple(row.percentage, std::string(row.word), std::string(row.err)),
-                  ApplyStageSeen());
+        if (content)
+            WriteFile(kApplyStatus, content);
+        EXPECT_EQ(seen, ApplyStageSeen()) << (content ? content : "(no file)");
     }
 }
 
@@ -93,44 +64,42 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
 // file is replaced thousands of times.
 TEST_F(SmallUpdateApplyTest, PollerInAnotherProcessNeverSeesATornFile) {
     auto stageFor = [](int p) { return static_cast<SmallUpdate::APPLY_STAGE>(2 + p % 5); };
-    auto errFor = [](int p) { return "e" + std::to_string(p); };
-    ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(0, stageFor(0), errFor(0)));
-    auto write = [&](int i) {
-        return SmallUpdate::UpdateApplyProgress(i % 101, stageFor(i % 101), errFor(i % 101));
+    auto seenFor = [&](int p) {
+        return std::to_string(p) + " " + kWords[stageFor(p)] + " e" + std::to_string(p);
     };
-    EXPECT_EQ(0, RaceReaderAgainstWriter(3000, write,
-                                         [&] {
-                                             auto [percentage, word, err] = ApplyStageSeen();
-                                             if (percentage < 0 || percentage > 100)
-                                                 return 1;
-                                             return word != kWords[stageFor(percentage)] ||
-                                                            err != errFor(percentage)
-                                                        ? 2
-                                                        : 0;
-                                         }))
-        << "1: bad percentage, 2: stage or message torn";
-    EXPECT_FALSE(TempFilesLeft());
+    auto write = [&](int i) {
+        return SmallUpdate::UpdateApplyProgress(i % 101, stageFor(i % 101),
+                                                "e" + std::to_string(i % 101));
+    };
+    ASSERT_TRUE(write(0));
+    auto check = [&] {
+        const std::string seen = ApplyStageSeen();
+        const int p = atoi(seen.c_str());
+        return p >= 0 && p <= 100 && seen == seenFor(p) ? 0 : 1;
+    };
+    EXPECT_EQ(0, RaceReaderAgainstWriter(3000, write, check)) << "a torn or missing record";
+    EXPECT_FALSE(AnyEntryStartsWith("/var/run", "applySmallUpd@te.status_"));
 }
 
 TEST_F(SmallUpdateApplyTest, InstallsEveryPackageInSmallFixOrderWithProgress) {
     EXPECT_TRUE(u.InstallDeb(30, SmallUpdate::APPLY_STAGE_PROGRAM));  // nothing to install
     EXPECT_FALSE(PathExists(kApplyStatus));
     Shell("mkdir -p /smallupd@te/updater");
-    const std::string broken = Deb("broken", 1, true);
-    u.m_installDebs = {Deb("fixc", 12), broken, Deb("fixb", 5)};
+    const std::string broken = ApplyDeb("broken", 1, true);
+    u.m_installDebs = {ApplyDeb("fixc", 12), broken, ApplyDeb("fixb", 5)};
     EXPECT_FALSE(u.InstallDeb(30, SmallUpdate::APPLY_STAGE_PROGRAM));
     // Sorted in place; the failing package does not stop the others.
     EXPECT_EQ(broken, u.m_installDebs.front());
     EXPECT_EQ((std::vector<std::string>{"fixb 53", "fixc 76"}), FileLines(kOrderLog));
     EXPECT_EQ(3u, FileLines("/var/log/dpkg_upgrade.log", "===========[-i " + kDebDir).size());
-    EXPECT_EQ("percentage=\"99\"\nstage=\"3\"\nErrMsg=\"\"\n", ReadFile(kApplyStatus).value_or(""));
+    EXPECT_EQ("percentage=\"99\"\nstage=\"3\"\nErrMsg=\"\"\n", ReadFile(kApplyStatus));
     EXPECT_TRUE(SyslogContains("Failed to install " + kDebDir + "/" + broken, LOG_ERR));
     EXPECT_FALSE(PathExists(kStaging)) << "a failed install drops the staging folder";
 }
 
 TEST_F(SmallUpdateApplyTest, RebootUpdateStagesPackagesForTheNextBoot) {
     u.m_blNeedReboot = true;
-    const std::string second = Deb("stageb", 9), first = Deb("stagea", 1);
+    const std::string second = ApplyDeb("stageb", 9), first = ApplyDeb("stagea", 1);
     u.m_installDebs = {second, first};
     ASSERT_TRUE(u.InstallDeb(30, SmallUpdate::APPLY_STAGE_REBOOT));
     EXPECT_EQ(0700u, ModeOf(kStaging));
@@ -138,11 +107,10 @@ TEST_F(SmallUpdateApplyTest, RebootUpdateStagesPackagesForTheNextBoot) {
     EXPECT_FALSE(PathExists(kDebDir + "/" + first));
     EXPECT_EQ((std::vector<std::string>{second, first}), u.m_installDebs);  // not sorted
     EXPECT_FALSE(DpkgInstalled("stagea"));
-    EXPECT_EQ("percentage=\"100\"\nstage=\"6\"\nErrMsg=\"\"\n",
-              ReadFile(kApplyStatus).value_or(""));
+    EXPECT_EQ("percentage=\"100\"\nstage=\"6\"\nErrMsg=\"\"\n", ReadFile(kApplyStatus));
 
     // A package that is not there: the staging folder is dropped at once.
-    u.m_installDebs = {Deb("stagec", 3), "missing_6.1-5644-s4_all.deb"};
+    u.m_installDebs = {ApplyDeb("stagec", 3), "missing_6.1-5644-s4_all.deb"};
     EXPECT_FALSE(u.InstallDeb(30, SmallUpdate::APPLY_STAGE_PROGRAM));
     EXPECT_FALSE(PathExists(kStaging));
     EXPECT_TRUE(SyslogContains("Failed to mv " + kDebDir + "/missing_6.1-5644-s4_all.deb to " +
@@ -154,12 +122,12 @@ TEST_F(SmallUpdateApplyTest, FlashUpdaterRunsInItsFolderAndUnpackStagesPayloads)
     const std::string record =
         "#!/bin/sh\necho \"$@\" > /tmp/updater.args\npwd >> /tmp/updater.args\nexit ";
     u.m_blFlashUpdate = true;
-    u.m_flashUpdateDeb = Deb("flashok", 4, false, {{"/updater", record + "0\n"}});
+    u.m_flashUpdateDeb = ApplyDeb("flashok", 4, false, {{"/updater", record + "0\n"}});
     ASSERT_TRUE(u.UpdateFlash());
     EXPECT_EQ("-r /\n/flashUpd@teTempFolder\n", ReadFile("/tmp/updater.args").value_or(""));
     char cwd[64];
     EXPECT_STREQ("/", getcwd(cwd, sizeof cwd));  // the caller's folder is restored
-    u.m_flashUpdateDeb = Deb("flashbad", 4, false, {{"/updater", record + "3\n"}});
+    u.m_flashUpdateDeb = ApplyDeb("flashbad", 4, false, {{"/updater", record + "3\n"}});
     EXPECT_FALSE(u.UpdateFlash());
     EXPECT_TRUE(SyslogContains("failed to exec updater -r", LOG_ERR));
     u.m_flashUpdateDeb = "absent_6.1-5644-s4_all.deb";  // not extractable: nothing left
@@ -167,9 +135,9 @@ TEST_F(SmallUpdateApplyTest, FlashUpdaterRunsInItsFolderAndUnpackStagesPayloads)
     EXPECT_FALSE(PathExists("/flashUpd@teTempFolder"));
 
     // The configuration updater is staged when asked for, the boot payload for a reboot.
-    u.m_smallUpdateDeb = Deb("smallfix", 6, false,
-                             {{"/configupdate", "#!/bin/sh\nexit 0\n"},
-                              {"/smallupd@ter/boot.sh", "#!/bin/sh\nexit 0\n"}});
+    u.m_smallUpdateDeb = ApplyDeb("smallfix", 6, false,
+                                  {{"/configupdate", "#!/bin/sh\nexit 0\n"},
+                                   {"/smallupd@ter/boot.sh", "#!/bin/sh\nexit 0\n"}});
     using Names = std::vector<std::string>;
     for (bool reboot : {true, false}) {
         Shell("rm -rf /smallupd@te");

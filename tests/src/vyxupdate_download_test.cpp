@@ -36,11 +36,8 @@ TEST_F(VyxServerTest, CheckAsksOnceAndFailsWithoutAFeed) {
     VyxUpdate vyx;
     bool haveNew = false, canStart = false;
     ASSERT_EQ(1, vyx.CheckNewRelease(haveNew));
-    EXPECT_TRUE(haveNew);
-    EXPECT_EQ("VYX 5.2-5700", vyx.GetFullVersion());
+    EXPECT_TRUE(haveNew && vyx.PreCheckDownload(canStart) == 1 && canStart);
     EXPECT_FALSE(PathExists("/var/run/autoupdate_tmp_file_RSS"));
-    EXPECT_EQ(1, vyx.PreCheckDownload(canStart));
-    EXPECT_TRUE(canStart);
     auto requests = server->RequestsFor(kFeedPath);
     ASSERT_EQ(1u, requests.size());  // the answer is reused
     EXPECT_EQ("tz=Europe/Berlin demo_model VYX5.2 5644 (autoupgrade)",
@@ -54,9 +51,7 @@ TEST_F(VyxServerTest, CheckAsksOnceAndFailsWithoutAFeed) {
         server->FailPath(kFeedPath, 404, 1);
         SetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server",
                     rss.empty() ? std::nullopt : std::optional<std::string>(rss));
-        VyxUpdate failed;
-        EXPECT_EQ(0, failed.CheckNewRelease(haveNew));
-        EXPECT_FALSE(failed.m_checked);
+        EXPECT_EQ(0, VyxUpdate().CheckNewRelease(haveNew));
         EXPECT_TRUE(SyslogContains(
             "Fail to exec command [/usr/kyto/bin/wget --user-agent='demo_model VYX5.2 5644 "
             "(autoupgrade)' -O /var/run/autoupdate_tmp_file_RSS " +
@@ -64,8 +59,8 @@ TEST_F(VyxServerTest, CheckAsksOnceAndFailsWithoutAFeed) {
             "?tz=Europe/Berlin 2> /dev/null]. [0x"));
         EXPECT_FALSE(PathExists("/var/run/autoupdate_tmp_file_RSS"));
     }
-    EXPECT_TRUE(SyslogContains("Fail to get RSS file"));
-    EXPECT_TRUE(SyslogContains("Fail to get latest VYX info"));
+    EXPECT_TRUE(SyslogContains("Fail to get RSS file") &&
+                SyslogContains("Fail to get latest VYX info"));
 }
 
 TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
@@ -94,17 +89,15 @@ TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
 
 TEST_F(VyxServerTest, RunningDownloadReportsProgressThenRecordsTheImageAndNotifies) {
     pid_t downloader = StartSlowDownload(256 << 10);
-    EXPECT_EQ((std::map<std::string, std::string>{{"updateType", "vyxupdate"},
-                                                  {"downloadStatus", "downloading"},
-                                                  {"downloadCount", "1"},
-                                                  {"downloadNum", "1"},
-                                                  {"patchPath", kSlow}}),
-              ReadKeyValueFile(kStatus));
+    // clang-format off
+    EXPECT_EQ((std::map<std::string, std::string>{{"updateType", "vyxupdate"}, {"patchPath", kSlow},
+        {"downloadStatus", "downloading"}, {"downloadCount", "1"}, {"downloadNum", "1"}}),
+        ReadKeyValueFile(kStatus));
+    // clang-format on
     EXPECT_NE(downloader, KLIBCReadPidFile(kPid));  // wget's own pid
     std::pair<Status, int> seen;
     EXPECT_TRUE(WaitFor([&] { return (seen = DownloadStatus()).second > 0; }));
-    EXPECT_EQ(kRunning, seen.first);
-    EXPECT_LT(seen.second, 100);
+    EXPECT_TRUE(seen.first == kRunning && seen.second < 100) << seen.first << " " << seen.second;
 
     EXPECT_EQ(1, Wait(downloader));
     EXPECT_EQ(256u << 10, ReadFile(kSlow).value_or("").size());
@@ -117,36 +110,29 @@ TEST_F(VyxServerTest, RunningDownloadReportsProgressThenRecordsTheImageAndNotifi
     EXPECT_EQ(std::make_pair(kFinished, 100), DownloadStatus());
 }
 
-// A cancel from another process kills the running wget, on the first attempt or on a retry
-// after a failed one (the pid file names the attempt that runs now), and ends the retries.
-TEST_F(VyxServerTest, CancelFromAnotherProcessEndsTheRetries) {
-    for (int failedBefore : {0, 1}) {
-        SCOPED_TRACE(failedBefore);
-        server->ClearRequests();
-        RemoveTree(kSlow);  // bytes on disk must come from this download
-        if (failedBefore)
-            server->FailPath("/img/slow.img", 503, failedBefore);
-        pid_t downloader = StartSlowDownload(4 << 20);
-        // Held still so that the canceller's "stopped" is seen before the downloader
-        // clears the status file.
-        ASSERT_EQ(0, kill(downloader, SIGSTOP));
-        EXPECT_TRUE(VyxUpdate::CancelDownloadVyx());
-        EXPECT_FALSE(PathExists(kPid));
-        EXPECT_EQ(kStopped, DownloadStatus().first);
-        ASSERT_EQ(0, kill(downloader, SIGCONT));
-
-        EXPECT_EQ(1, Wait(downloader));
-        EXPECT_TRUE(SyslogContains("Download process is cancelled"));
-        EXPECT_FALSE(PathExists(kStatus) || PathExists(kInfo));
-        EXPECT_TRUE(PathExists(kSlow));        // the partial image stays
-        EXPECT_TRUE(RecordedCalls().empty());  // no notification
-        // No further attempt.  The server logs a request once its connection ends.
-        const size_t attempts = failedBefore + 1;
-        auto requests = [&] { return server->RequestsFor("/img/slow.img").size(); };
-        EXPECT_TRUE(WaitFor([&] { return requests() >= attempts; }));
-        EXPECT_EQ(attempts, requests());
-    }
+// A cancel from another process kills the running wget, here on the retry after a failed
+// attempt (the pid file names the attempt that runs now), and ends the retries.  A cancel
+// of a first attempt is part of the facade's test.
+TEST_F(VyxServerTest, CancelBetweenRetriesEndsThem) {
+    server->FailPath("/img/slow.img", 503, 1);
+    pid_t downloader = StartSlowDownload(4 << 20);
+    // Held still so that the canceller's "stopped" is seen before the downloader clears
+    // the status file.
+    ASSERT_EQ(0, kill(downloader, SIGSTOP));
+    EXPECT_TRUE(VyxUpdate::CancelDownloadVyx());
+    EXPECT_FALSE(PathExists(kPid));
+    EXPECT_EQ(kStopped, DownloadStatus().first);
+    ASSERT_EQ(0, kill(downloader, SIGCONT));
+    EXPECT_EQ(1, Wait(downloader));
+    EXPECT_TRUE(SyslogContains("Download process is cancelled"));
     EXPECT_FALSE(SyslogContains("Fail to kill download VYX process"));
+    EXPECT_FALSE(PathExists(kStatus) || PathExists(kInfo));
+    EXPECT_TRUE(PathExists(kSlow));        // the partial image stays
+    EXPECT_TRUE(RecordedCalls().empty());  // no notification
+    // No third attempt.  The server logs a request once its connection ends.
+    auto requests = [&] { return server->RequestsFor("/img/slow.img").size(); };
+    EXPECT_TRUE(WaitFor([&] { return requests() >= 2; }));
+    EXPECT_EQ(2u, requests());
 }
 
 TEST_F(VyxServerTest, FailedDownloadsNotifyAndLogTheEvent) {
@@ -176,8 +162,8 @@ TEST_F(VyxServerTest, FailedDownloadsNotifyAndLogTheEvent) {
     ClearRecordedCalls();
     ServeFeed({{"other_model", server->Url("/images/vyx.img"), "00"}});
     EXPECT_EQ(0, VyxUpdate().DownloadVyx());
-    EXPECT_TRUE(SyslogContains("Current VYX version is latest"));
-    EXPECT_TRUE(SyslogContains("Fail to do pre check download"));
+    EXPECT_TRUE(SyslogContains("Current VYX version is latest") &&
+                SyslogContains("Fail to do pre check download"));
     EXPECT_EQ(DownloadNotification(false), RecordedCalls());
 }
 
@@ -242,8 +228,8 @@ TEST_F(VyxStatusTest, StatusFileDecisions) {
             WriteFile(kPid, c.pid);
         EXPECT_EQ(std::make_pair(c.expect, c.percentage), DownloadStatus(c.ok));
     }
-    EXPECT_TRUE(SyslogContains("Invalid pid [0] in pid file [/var/run/downloadVYX.pid]"));
-    EXPECT_TRUE(SyslogContains("Fail to get [patchPath] from [/var/run/downloadVYX.status]"));
+    EXPECT_TRUE(SyslogContains("Invalid pid [0] in pid file [/var/run/downloadVYX.pid]") &&
+                SyslogContains("Fail to get [patchPath] from [/var/run/downloadVYX.status]"));
     // A complete newer download wins over whatever the status file says.
     WriteFile(kInfo, R"({"updateType":"vyxupdate","buildnumber":"5700",
         "majorversion":"5","minorversion":"2","patchPath":"/tmp/img"})");
@@ -272,10 +258,10 @@ TEST_F(VyxStatusTest, PercentageOfOneImage) {
     }
     int percentage = 0;
     EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/none", percentage));
-    EXPECT_TRUE(SyslogContains("Fail to do stat to [/tmp/none]"));
     unlink(kProgress);
     EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/img", percentage));
-    EXPECT_TRUE(SyslogContains("Fail to open file [/var/run/downloadprogress] for reading"));
+    EXPECT_TRUE(SyslogContains("Fail to do stat to [/tmp/none]") &&
+                SyslogContains("Fail to open file [/var/run/downloadprogress] for reading"));
 }
 
 TEST_F(VyxStatusTest, CancelWithoutDownloadAndInstallerProgress) {

@@ -61,11 +61,24 @@ std::string BuildDebName(const DebPackage& pkg, const std::string& folder) {
     return path.substr(path.rfind('/') + 1);
 }
 
-std::tuple<int, std::string, std::string> ApplyStageSeen() {
+std::string ApplyStageSeen() {
     int percentage = -7;
     std::string word = "caller-stage", err = "caller-err";
     SmallUpdate::GetApplyStage(percentage, word, err);
-    return {percentage, word, err};
+    return std::to_string(percentage) + " " + word + " " + err;
+}
+
+std::string ApplyDeb(const std::string& name, int fix, bool fails,
+                     const std::map<std::string, std::string>& files) {
+    DebPackage pkg = fails ? FailingDeb(name, SmallFixVersion("6.1", 5644, fix))
+                           : MakeDebPackage(name, SmallFixVersion("6.1", 5644, fix));
+    if (!fails && files.empty()) {
+        pkg.postinst = "#!/bin/sh\necho " + name +
+                       " $(sed -n 's/^percentage=\"\\(.*\\)\"/\\1/p' "
+                       "/var/run/applySmallUpd@te.status) >> /tmp/install_order.log\n";
+    }
+    pkg.files = files;
+    return BuildDebName(pkg, "/volume1/@smallupd@te_deb");
 }
 
 SmallUpdate DumpableRecord() {

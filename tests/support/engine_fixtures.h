@@ -6,9 +6,9 @@
 #include <sys/types.h>
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <string>
-#include <tuple>
 #include <vector>
 
 #include <json/json.h>
@@ -48,9 +48,15 @@ class ReleaseServerTest : public SandboxTest {
 
 // Builds the package into folder and returns its file name.
 std::string BuildDebName(const DebPackage& pkg, const std::string& folder);
-// What SmallUpdate::GetApplyStage reports, starting from the caller's own values
-// -7, "caller-stage" and "caller-err".
-std::tuple<int, std::string, std::string> ApplyStageSeen();
+// What SmallUpdate::GetApplyStage reports, "<percentage> <stage word> <error>", starting
+// from the caller's own values -7, "caller-stage" and "caller-err".
+std::string ApplyStageSeen();
+// Builds a package of small fix `fix` (build 5644) into the apply's package folder
+// "/volume1/@smallupd@te_deb" and returns its file name.  Without `files` its postinst appends
+// "<name> <percentage>" to /tmp/install_order.log, the percentage being the one the apply
+// status file holds then; a failing package's postinst exits 1 instead.
+std::string ApplyDeb(const std::string& name, int fix, bool fails = false,
+                     const std::map<std::string, std::string>& files = {});
 // A record for build 5644, fix 7, that dumps cleanly: one small-update package with its link,
 // package folder "/volume1/d".
 SmallUpdate DumpableRecord();

@@ -614,4 +614,12 @@ int RaceReaderAgainstWriter(int writes, const std::function<bool(int)>& write,
     return Wait(reader);
 }
 
+bool AnyEntryStartsWith(const std::string& folder, const std::string& prefix) {
+    for (const std::string& name : ListDir(folder)) {
+        if (name.rfind(prefix, 0) == 0)
+            return true;
+    }
+    return false;
+}
+
 }  // namespace kytotest

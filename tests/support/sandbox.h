@@ -77,6 +77,8 @@ bool PathExists(const std::string& path);  // lstat succeeds
 bool IsDirectory(const std::string& path);
 void RemoveTree(const std::string& path);
 std::vector<std::string> ListDir(const std::string& path);  // sorted names, no . and ..
+// True when some entry of folder has a name starting with prefix (a temporary file left).
+bool AnyEntryStartsWith(const std::string& folder, const std::string& prefix);
 // Parses a key=value file (both line forms; quotes removed).  Empty map when missing.
 std::map<std::string, std::string> ReadKeyValueFile(const std::string& path);
 // Sets or removes (value nullopt) one key of a key=value file, writing key="value".
