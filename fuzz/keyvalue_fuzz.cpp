@@ -2,8 +2,10 @@
 // the caller's buffer size, the key up to the first newline, then the file's bytes.  The
 // value read must be what a plain reading of the file's lines gives (first line whose key,
 // blanks around it ignored, matches; blanks around the value dropped; one pair of enclosing
-// double quotes removed), cut to the buffer; and a value written with
-// KLIBCFileSetKeyValue must read back unchanged.
+// double quotes removed; a line over the platform's limit makes the file unreadable), cut
+// to the buffer; and a value written with KLIBCFileSetKeyValue must read back unchanged.
+// With the size byte's top bit set, a line of about the limit's length (one of the four
+// lengths around it) is appended to the file.
 #include <string.h>
 
 #include <string>
@@ -77,7 +79,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (nl == std::string::npos)
         return 0;
     const std::string key = rest.substr(0, nl);
-    const std::string file = rest.substr(nl + 1);
+    std::string file = rest.substr(nl + 1);
+    if (data[0] & 0x80)
+        file += "\n" + std::string(KLIBC_KV_MAX_LINE - 2 + (data[0] & 3), 'v');
     if (key.empty() || key.find('\0') != std::string::npos)
         return 0;
     kytofuzz::WriteWhole(kFile, file);
@@ -88,7 +92,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     std::string value;
     const int expected = ReferenceGet(file, key, value);
     if (expected < 0) {
-        KYTO_FUZZ_CHECK(got == -1);
+        KYTO_FUZZ_CHECK(got == -1 && buf[0] == 'Z');  // an unreadable file leaves buf alone
         return 0;
     }
     if (expected == 0) {

@@ -13,7 +13,7 @@
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
-BUILD=${KYTO_FUZZ_BUILD:-$ROOT/build-f2-fuzz}
+BUILD=${KYTO_FUZZ_BUILD:-$ROOT/build-fuzz}
 ALL=(feed_line feed_file patch_list info_file keyvalue download_status apply_stage)
 
 LIMIT=-runs=10000000

@@ -52,7 +52,14 @@ FILE* g_report = stderr;
 
 void Problem(const std::string& what) {
     ++g_problems;
-    fprintf(g_report, "crash_trials: %s\n", what.c_str());
+    fprintf(g_report, "crash_trials: %s; last system log lines:\n", what.c_str());
+    // The sandbox's syslog catcher writes every message to this file.
+    FILE* log = popen("tail -n 6 /var/log/sandbox.syslog", "r");
+    char line[1024];
+    while (log && fgets(line, sizeof line, log))
+        fprintf(g_report, "    %s", line);
+    if (log)
+        pclose(log);
 }
 
 int Sh(const std::string& cmd) {
@@ -118,7 +125,9 @@ bool Publish() {
             return false;
         if (!proj.empty())
             proj += ",";
-        proj += "{\"name\":\"" + DebName(p) + "\",\"url\":\"" + g_base + "/debs/" + DebName(p) + "\"}";
+        // The first package is the small-update package itself, the others further ones.
+        const std::string name = p == kPackages[0] ? "smallupdate" : DebName(p);
+        proj += "{\"name\":\"" + name + "\",\"url\":\"" + g_base + "/debs/" + DebName(p) + "\"}";
     }
     std::string list = "{\"vyxversion\":5644,\"unique\":\"demo_model\",\"smallupdate\":[{\"version\":1,"
                        "\"flash_upgrade\":false,\"config_upgrade\":false,\"proj\":[" +
