@@ -10,12 +10,11 @@
 
 namespace {
 
-const char* const kTagNames[] = {"rss",        "channel",     "title",         "link",
-                                 "pubDate",    "copyright",   "item",          "MajorVer",
-                                 "MinorVer",   "BuildPhase",  "BuildNum",      "BuildDate",
-                                 "ReqMajorVer", "ReqMinorVer", "ReqBuildPhase", "ReqBuildNum",
-                                 "ReqBuildDate", "model",      "mUnique",       "mLink",
-                                 "mCheckSum"};
+const char* const kTagNames[] = {
+    "rss",         "channel",     "title",         "link",        "pubDate",      "copyright",
+    "item",        "MajorVer",    "MinorVer",      "BuildPhase",  "BuildNum",     "BuildDate",
+    "ReqMajorVer", "ReqMinorVer", "ReqBuildPhase", "ReqBuildNum", "ReqBuildDate", "model",
+    "mUnique",     "mLink",       "mCheckSum"};
 
 bool InTable(const std::string& name) {
     for (const char* n : kTagNames) {

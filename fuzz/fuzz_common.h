@@ -20,12 +20,12 @@
 namespace kytofuzz {
 
 // Aborts with a message: libFuzzer treats it as a crash and prints the input.
-#define KYTO_FUZZ_CHECK(cond)                                                                 \
-    do {                                                                                    \
-        if (!(cond)) {                                                                      \
+#define KYTO_FUZZ_CHECK(cond)                                                              \
+    do {                                                                                   \
+        if (!(cond)) {                                                                     \
             fprintf(stderr, "fuzz check failed: %s (%s:%d)\n", #cond, __FILE__, __LINE__); \
-            abort();                                                                        \
-        }                                                                                   \
+            abort();                                                                       \
+        }                                                                                  \
     } while (0)
 
 // Refuses to run on the real root: the sandbox leaves its marker file on an overlay root.

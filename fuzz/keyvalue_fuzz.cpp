@@ -98,7 +98,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (expected == 0) {
         KYTO_FUZZ_CHECK(got == 0 && buf[0] == '\0');
     } else {
-        const size_t n = value.size() < static_cast<size_t>(bufSize - 1) ? value.size() : bufSize - 1;
+        const size_t n =
+            value.size() < static_cast<size_t>(bufSize - 1) ? value.size() : bufSize - 1;
         KYTO_FUZZ_CHECK(got == static_cast<int>(n));
         KYTO_FUZZ_CHECK(memcmp(buf, value.data(), n) == 0 && buf[n] == '\0');
     }

@@ -123,8 +123,8 @@ class SmallFaultTest : public UpdateServerTest {
         std::string word;
         poller.GetDownloadStatus(p, word);
         EXPECT_EQ(percentage + " failed", std::to_string(p) + " " + word);
-        EXPECT_TRUE(SyslogContains("failed to exec cmd=[/usr/kyto/bin/wget http://127.0.0.1:",
-                                   LOG_ERR));
+        EXPECT_TRUE(
+            SyslogContains("failed to exec cmd=[/usr/kyto/bin/wget http://127.0.0.1:", LOG_ERR));
         EXPECT_FALSE(PathExists("/volume1/@smallupd@te_deb"));  // no partial package stays
         EXPECT_FALSE(PathExists(kInfo));
         EXPECT_EQ(keep, Md5Of(kKeep));

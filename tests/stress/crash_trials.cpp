@@ -119,8 +119,9 @@ bool Publish() {
                           " && printf 'Package: " + p +
                           "\\nVersion: 6.1-5644-s1\\nArchitecture: all\\nMaintainer: t <t@t>\\n"
                           "Description: stress\\n' > " +
-                          dir + "/DEBIAN/control && mkdir -p " + kServed + "/debs && dpkg-deb -Zgzip --build " +
-                          dir + " " + kServed + "/debs/" + DebName(p) + " >/dev/null";
+                          dir + "/DEBIAN/control && mkdir -p " + kServed +
+                          "/debs && dpkg-deb -Zgzip --build " + dir + " " + kServed + "/debs/" +
+                          DebName(p) + " >/dev/null";
         if (Sh(cmd) != 0)
             return false;
         if (!proj.empty())
@@ -129,9 +130,10 @@ bool Publish() {
         const std::string name = p == kPackages[0] ? "smallupdate" : DebName(p);
         proj += "{\"name\":\"" + name + "\",\"url\":\"" + g_base + "/debs/" + DebName(p) + "\"}";
     }
-    std::string list = "{\"vyxversion\":5644,\"unique\":\"demo_model\",\"smallupdate\":[{\"version\":1,"
-                       "\"flash_upgrade\":false,\"config_upgrade\":false,\"proj\":[" +
-                       proj + "],\"restart\":\"none\"}]}";
+    std::string list =
+        "{\"vyxversion\":5644,\"unique\":\"demo_model\",\"smallupdate\":[{\"version\":1,"
+        "\"flash_upgrade\":false,\"config_upgrade\":false,\"proj\":[" +
+        proj + "],\"restart\":\"none\"}]}";
     std::string listDir = std::string(kServed) + "/smallupdate/5644/demo_model";
     if (Sh("mkdir -p " + listDir + " " + kServed + "/img " + kServed + "/autoupdate") != 0 ||
         !WriteText(listDir + "/VYX-Security.json", list) ||
@@ -142,10 +144,11 @@ bool Publish() {
     if (!md5 || fscanf(md5, "%32s", sum) != 1)
         return false;
     pclose(md5);
-    std::string feed = "<rss>\n<channel>\n<item>\n<MajorVer>5</MajorVer>\n<MinorVer>2</MinorVer>\n"
-                       "<BuildNum>5700</BuildNum>\n<model>\n<mUnique>demo_model</mUnique>\n<mLink>" +
-                       g_base + "/img/vyx.img</mLink>\n<mCheckSum>" + sum +
-                       "</mCheckSum>\n</model>\n</item>\n</channel>\n</rss>\n";
+    std::string feed =
+        "<rss>\n<channel>\n<item>\n<MajorVer>5</MajorVer>\n<MinorVer>2</MinorVer>\n"
+        "<BuildNum>5700</BuildNum>\n<model>\n<mUnique>demo_model</mUnique>\n<mLink>" +
+        g_base + "/img/vyx.img</mLink>\n<mCheckSum>" + sum +
+        "</mCheckSum>\n</model>\n</item>\n</channel>\n</rss>\n";
     return WriteText(std::string(kServed) + "/autoupdate/genRSS.php", feed) &&
            KLIBCFileSetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server",
                                 (g_base + "/autoupdate/genRSS.php").c_str(), nullptr) == 1 &&
@@ -348,7 +351,8 @@ void ApplyTrial() {
     std::string fix;
     Tally("apply", InstalledFix(fix) ? "smallfixnumber " + fix : "no smallfixnumber");
     CheckInfoFile("apply");
-    Tally("apply", Exists("/volume1/@smallupd@te_deb") ? "package folder left" : "package folder gone");
+    Tally("apply",
+          Exists("/volume1/@smallupd@te_deb") ? "package folder left" : "package folder gone");
     std::string audit;
     if (FILE* a = popen("dpkg --audit 2>&1", "r")) {
         char line[256];
@@ -395,7 +399,8 @@ int main(int argc, char** argv) {
             kinds = argv[i] + 8;
     }
     srand(static_cast<unsigned>(seed));
-    fprintf(report, "crash_trials: %ld trials per kind (%s), seed %ld\n", trials, kinds.c_str(), seed);
+    fprintf(report, "crash_trials: %ld trials per kind (%s), seed %ld\n", trials, kinds.c_str(),
+            seed);
 
     mkdir("/volume1", 0755);
     if (mount("tmpfs", "/volume1", "tmpfs", 0, "size=419430400") != 0 || !StartServer() ||

@@ -40,12 +40,14 @@ constexpr long kImageTotal = 1048576;  // the size wget announced for both image
 const SmallUpdate::DOWNLOAD_STATUS kSmallStates[] = {
     SmallUpdate::DOWNLOAD_STATUS_INIT, SmallUpdate::DOWNLOAD_STATUS_DOWNLOADING,
     SmallUpdate::DOWNLOAD_STATUS_FINISHED, SmallUpdate::DOWNLOAD_STATUS_STOPPED};
-const SmallUpdate::APPLY_STAGE kStages[] = {
-    SmallUpdate::APPLY_STAGE_WAITING_REMOTE_UPGRADING, SmallUpdate::APPLY_STAGE_ANALYING,
-    SmallUpdate::APPLY_STAGE_PROGRAM, SmallUpdate::APPLY_STAGE_START_SERVICE,
-    SmallUpdate::APPLY_STAGE_FINISHED, SmallUpdate::APPLY_STAGE_REBOOT};
-const char* const kStageWords[] = {"waiting_remote_upgrading", "analying", "program",
-                                   "startService", "finished", "reboot"};
+const SmallUpdate::APPLY_STAGE kStages[] = {SmallUpdate::APPLY_STAGE_WAITING_REMOTE_UPGRADING,
+                                            SmallUpdate::APPLY_STAGE_ANALYING,
+                                            SmallUpdate::APPLY_STAGE_PROGRAM,
+                                            SmallUpdate::APPLY_STAGE_START_SERVICE,
+                                            SmallUpdate::APPLY_STAGE_FINISHED,
+                                            SmallUpdate::APPLY_STAGE_REBOOT};
+const char* const kStageWords[] = {
+    "waiting_remote_upgrading", "analying", "program", "startService", "finished", "reboot"};
 const char* const kErrTexts[] = {"", "remote node busy"};
 
 struct Shared {
@@ -57,8 +59,12 @@ struct Shared {
     std::atomic<long> parked;  // pollers waiting between the phases
 };
 
-int SmallPercentage(long i) { return static_cast<int>((i * 7) % 101); }
-int ApplyPercentage(long i) { return static_cast<int>((i * 13) % 101); }
+int SmallPercentage(long i) {
+    return static_cast<int>((i * 7) % 101);
+}
+int ApplyPercentage(long i) {
+    return static_cast<int>((i * 13) % 101);
+}
 
 // Percentages the full-release reader can give: any image number with either image's
 // path (the two keys are set one after the other).
@@ -219,9 +225,10 @@ int main(int argc, char** argv) {
         if (!WIFEXITED(st) || WEXITSTATUS(st) != 0)
             ++bad;
     }
-    printf("torn_reads: %ld rewrites, %ld polls by %ld pollers, %ld failures, %ld answers "
-           "combining two rewrites%s%s\n",
-           s->rewrites.load(), s->polls.load(), started, s->failures.load(), s->mixed.load(),
-           writeOk ? "" : ", A WRITE FAILED", bad ? ", A POLLER CRASHED" : "");
+    printf(
+        "torn_reads: %ld rewrites, %ld polls by %ld pollers, %ld failures, %ld answers "
+        "combining two rewrites%s%s\n",
+        s->rewrites.load(), s->polls.load(), started, s->failures.load(), s->mixed.load(),
+        writeOk ? "" : ", A WRITE FAILED", bad ? ", A POLLER CRASHED" : "");
     return (s->failures.load() == 0 && writeOk && bad == 0) ? 0 : 1;
 }
