@@ -53,9 +53,7 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
         {"percentage=\"30\"\n", "-7 none err_system"}};
     // clang-format on
     for (const auto& [content, seen] : rows) {
-        RemoveTree(kApplyStatus);
-        if (content)
-            WriteFile(kApplyStatus, content);
+        WriteOrRemove(kApplyStatus, content);
         EXPECT_EQ(seen, ApplyStageSeen()) << (content ? content : "(no file)");
     }
 }

@@ -220,12 +220,8 @@ TEST_F(VyxStatusTest, StatusFileDecisions) {
     WriteFile("/tmp/img", std::string(512 << 10, 'x'));
     for (const Case& c : cases) {
         SCOPED_TRACE(c.status + " pid " + c.pid);
-        RemoveTree(kStatus);
-        RemoveTree(kPid);
-        if (!c.status.empty())
-            WriteFile(kStatus, c.status);
-        if (!c.pid.empty())
-            WriteFile(kPid, c.pid);
+        WriteOrRemove(kStatus, c.status.empty() ? nullptr : c.status.c_str());
+        WriteOrRemove(kPid, c.pid.empty() ? nullptr : c.pid.c_str());
         EXPECT_EQ(std::make_pair(c.expect, c.percentage), DownloadStatus(c.ok));
     }
     EXPECT_TRUE(SyslogContains("Invalid pid [0] in pid file [/var/run/downloadVYX.pid]") &&

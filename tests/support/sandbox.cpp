@@ -622,4 +622,10 @@ bool AnyEntryStartsWith(const std::string& folder, const std::string& prefix) {
     return false;
 }
 
+void WriteOrRemove(const std::string& path, const char* content) {
+    RemoveTree(path);
+    if (content)
+        WriteFile(path, content);
+}
+
 }  // namespace kytotest

@@ -73,6 +73,8 @@ void ClearSyslog();
 std::optional<std::string> ReadFile(const std::string& path);
 // Writes content (creating parent folders), replacing the file; mode applied.
 void WriteFile(const std::string& path, const std::string& content, mode_t mode = 0644);
+// Writes content as WriteFile does, or removes path (a file or tree) when content is nullptr.
+void WriteOrRemove(const std::string& path, const char* content);
 bool PathExists(const std::string& path);  // lstat succeeds
 bool IsDirectory(const std::string& path);
 void RemoveTree(const std::string& path);
