@@ -4,6 +4,9 @@
 KYTO_BUILD_PACKAGES=(cmake g++ make pkg-config libjsoncpp-dev libcurl4-openssl-dev libcli11-dev)
 KYTO_TEST_PACKAGES=(googletest libgtest-dev libgmock-dev libbenchmark-dev wget openssl tar
     dpkg dpkg-dev python3 util-linux clang-format ca-certificates)
+# Hardening checks (scripts/hardening.sh): libFuzzer targets built with clang, its runtime
+# libraries (libFuzzer and the sanitizers), and Valgrind's memcheck for the leak run.
+KYTO_HARDENING_PACKAGES=(clang libclang-rt-dev valgrind)
 KYTO_DEMO_PACKAGES=(nginx)  # the sample update server of scripts/demo.sh
 
 kyto_install_packages() {
