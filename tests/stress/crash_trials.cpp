@@ -345,8 +345,11 @@ void ApplyTrial() {
     std::string stage = "unset", err = "unset";
     SmallUpdate::GetApplyStage(p, stage, err);
     Tally("apply", "stage " + stage + (err == "unset" ? "" : " [" + err + "]"));
-    if (stage == "unset" || stage == "none")
-        Problem("apply: apply status unreadable after the kill: " + stage);
+    // "none" with the caller's error text untouched: no apply status file yet (the check
+    // before the download deletes an old one, and the kill came before the first write).
+    // "none" with "err_system" would be a file whose keys could not be read.
+    if (stage == "unset" || (stage == "none" && err != "unset"))
+        Problem("apply: apply status unreadable after the kill: " + stage + " [" + err + "]");
     WaitForOrphans();
     std::string fix;
     Tally("apply", InstalledFix(fix) ? "smallfixnumber " + fix : "no smallfixnumber");
