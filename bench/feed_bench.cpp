@@ -51,11 +51,12 @@ bool WriteFeed(const char* deviceModel, size_t& bytes, std::string& link, std::s
     if (f == nullptr)
         return false;
     unsigned seed = 1;
-    fputs("<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<rss version=\"2.0\">\n<channel>\n"
-          "\t<title>VYX releases</title>\n\t<link>http://update.kyto.local/</link>\n"
-          "\t<pubDate>Thu, 01 Oct 2026 00:00:00 GMT</pubDate>\n"
-          "\t<copyright>Kyto</copyright>\n",
-          f);
+    fputs(
+        "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<rss version=\"2.0\">\n<channel>\n"
+        "\t<title>VYX releases</title>\n\t<link>http://update.kyto.local/</link>\n"
+        "\t<pubDate>Thu, 01 Oct 2026 00:00:00 GMT</pubDate>\n"
+        "\t<copyright>Kyto</copyright>\n",
+        f);
     for (int item = 0; item < kItems; ++item) {
         const int build = 6000 + item;
         fprintf(f,
@@ -180,8 +181,9 @@ int main(int argc, char** argv) {
     if (parse <= 0 || grep <= 0)
         return 1;
     const double mb = static_cast<double>(g_bytes) / 1e6;
-    printf("\nParseRssFile %.1f ms (%.0f MB/s), grep -c %.1f ms (%.0f MB/s): the reader runs at "
-           "%.2f of grep's throughput (goal 0.33 or more)\n",
-           parse, mb / (parse / 1e3), grep, mb / (grep / 1e3), grep / parse);
+    printf(
+        "\nParseRssFile %.1f ms (%.0f MB/s), grep -c %.1f ms (%.0f MB/s): the reader runs at "
+        "%.2f of grep's throughput (goal 0.33 or more)\n",
+        parse, mb / (parse / 1e3), grep, mb / (grep / 1e3), grep / parse);
     return 0;
 }

@@ -179,8 +179,9 @@ int main(int argc, char** argv) {
 
     // Real time is what a poller waits; CPU time (this process's, kernel included) is
     // less disturbed by whatever else runs on the machine.
-    printf("\nmedians of the repetitions, microseconds per poll\n%-32s %8s %8s %6s %8s %8s %6s %6s\n",
-           "reader", "poll", "1 read", "ratio", "poll cpu", "1 rd cpu", "ratio", "goal");
+    printf(
+        "\nmedians of the repetitions, microseconds per poll\n%-32s %8s %8s %6s %8s %8s %6s %6s\n",
+        "reader", "poll", "1 read", "ratio", "poll cpu", "1 rd cpu", "ratio", "goal");
     for (const Pair& p : pairs) {
         double poll = reporter.Median(p.reader);
         double read = reporter.Median(p.baseline);

@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -69,18 +70,153 @@ void SplitPath(const std::string& path, std::string* dir, std::string* base) {
 
 namespace kytoplat {
 
-UniqueFd OpenFileForReading(const char* path) {
+namespace {
+
+// Opens an existing file that is not a folder for reading and gives back its status.
+UniqueFd OpenForReading(const char* path, struct stat* st) {
     UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
     if (!fd.valid()) {
         KYTO_FAIL(OpenErrorCode(errno, KYTO_ERR_FILE_OPEN));
         return fd;
     }
-    struct stat st;
-    if (::fstat(fd.get(), &st) != 0 || S_ISDIR(st.st_mode)) {
+    if (::fstat(fd.get(), st) != 0 || S_ISDIR(st->st_mode)) {
         KYTO_FAIL(KYTO_ERR_FILE_OPEN);
         fd.reset();
     }
     return fd;
+}
+
+// Whether [line, line + len) is a key=value line for key; if so, [*value, *value +
+// *valueLen) is its value with the blanks around it and one pair of surrounding double
+// quotes removed.  Works on the bytes as they are: a line may hold NUL bytes.
+bool LineMatches(const char* line, size_t len, const char* key, size_t keyLen, const char** value,
+                 size_t* valueLen) {
+    size_t b = 0;
+    while (b < len && IsBlank(line[b]))
+        ++b;
+    if (b == len || line[b] == '#')
+        return false;
+    const char* eqp = static_cast<const char*>(memchr(line + b, '=', len - b));
+    if (eqp == nullptr)
+        return false;
+    size_t eq = static_cast<size_t>(eqp - line);
+    size_t e = eq;
+    while (e > b && IsBlank(line[e - 1]))
+        --e;
+    if (e - b != keyLen || memcmp(line + b, key, keyLen) != 0)
+        return false;
+    size_t vb = eq + 1;
+    size_t ve = len;
+    while (vb < ve && IsBlank(line[vb]))
+        ++vb;
+    while (ve > vb && IsBlank(line[ve - 1]))
+        --ve;
+    if (ve - vb >= 2 && line[vb] == '"' && line[ve - 1] == '"') {
+        ++vb;
+        --ve;
+    }
+    *value = line + vb;
+    *valueLen = ve - vb;
+    return true;
+}
+
+// Looks key up in the file at path, with the same answers as loading every line with
+// KvLoad and taking the first match (a line over the limit or a failed read anywhere in
+// the file fails the whole lookup), but without building the lines: status pollers call
+// this several times a second.  A small file (every status file) is read into a stack
+// buffer with one read and parsed in place; a larger one streams through a buffer with
+// room for the longest allowed line.  deliver(value, length) is called once, for a found
+// key, when the whole file has been read.  1 found, 0 absent, -1 error (last error set).
+template <typename Deliver>
+int KvLookup(const char* path, const char* key, size_t keyLen, Deliver&& deliver) {
+    struct stat st;
+    UniqueFd fd = OpenForReading(path, &st);
+    if (!fd.valid())
+        return -1;
+    // A regular file whose reported size has been read in full ends at the first short
+    // read: no extra read to see the end.  Other files (pipes, /proc files that report
+    // a size of 0) are read until read says the end.
+    const bool sizeKnown = S_ISREG(st.st_mode) && st.st_size > 0;
+    const unsigned long long expected = static_cast<unsigned long long>(st.st_size);
+    unsigned long long total = 0;
+
+    char small[8192];
+    std::unique_ptr<char[]> large;
+    constexpr size_t kLargeSize = KLIBC_KV_MAX_LINE + 1 + 65536;
+    char* buf = small;
+    size_t cap = sizeof small;
+    size_t start = 0;  // beginning of the line not yet complete
+    size_t fill = 0;   // bytes in buf
+
+    bool found = false;
+    const char* value = nullptr;
+    size_t valueLen = 0;
+    bool valueInLarge = false;  // the large buffer is reused: the value is saved first
+    std::string saved;
+
+    for (;;) {
+        if (fill == cap) {
+            // Full: keep only the incomplete line, in the large buffer.
+            if (valueInLarge) {
+                saved.assign(value, valueLen);
+                value = saved.data();
+                valueInLarge = false;
+            }
+            if (!large) {
+                large.reset(new char[kLargeSize]);
+                memcpy(large.get(), buf + start, fill - start);
+            } else {
+                memmove(large.get(), buf + start, fill - start);
+            }
+            buf = large.get();
+            cap = kLargeSize;
+            fill -= start;
+            start = 0;
+        }
+        const size_t asked = cap - fill;
+        ssize_t n = ReadRetry(fd.get(), buf + fill, asked);
+        if (n < 0) {
+            KYTO_FAIL(KYTO_ERR_FILE_READ);
+            return -1;
+        }
+        if (n == 0)
+            break;
+        size_t scan = fill;
+        fill += static_cast<size_t>(n);
+        total += static_cast<unsigned long long>(n);
+        while (const char* nl = static_cast<const char*>(memchr(buf + scan, '\n', fill - scan))) {
+            size_t end = static_cast<size_t>(nl - buf);
+            if (end - start > KLIBC_KV_MAX_LINE) {
+                KYTO_FAIL(KYTO_ERR_LINE_TOO_LONG);
+                return -1;
+            }
+            if (!found) {
+                found = LineMatches(buf + start, end - start, key, keyLen, &value, &valueLen);
+                valueInLarge = found && buf == large.get();
+            }
+            start = scan = end + 1;
+        }
+        if (fill - start > KLIBC_KV_MAX_LINE) {
+            KYTO_FAIL(KYTO_ERR_LINE_TOO_LONG);
+            return -1;
+        }
+        if (sizeKnown && static_cast<size_t>(n) < asked && total >= expected)
+            break;
+    }
+    // The last line may lack its newline.
+    if (!found && fill > start)
+        found = LineMatches(buf + start, fill - start, key, keyLen, &value, &valueLen);
+    if (!found)
+        return 0;
+    deliver(value, valueLen);
+    return 1;
+}
+
+}  // namespace
+
+UniqueFd OpenFileForReading(const char* path) {
+    struct stat st;
+    return OpenForReading(path, &st);
 }
 
 int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewline) {
@@ -126,31 +262,12 @@ int KvLoad(const char* path, std::vector<std::string>* lines, bool* endsWithNewl
 }
 
 bool KvLineMatches(const std::string& line, const std::string& key, std::string* value) {
-    size_t b = 0;
-    while (b < line.size() && IsBlank(line[b]))
-        ++b;
-    if (b == line.size() || line[b] == '#')
+    const char* v;
+    size_t n;
+    if (!LineMatches(line.data(), line.size(), key.data(), key.size(), &v, &n))
         return false;
-    size_t eq = line.find('=', b);
-    if (eq == std::string::npos)
-        return false;
-    size_t e = eq;
-    while (e > b && IsBlank(line[e - 1]))
-        --e;
-    if (line.compare(b, e - b, key) != 0 || e - b != key.size())
-        return false;
-    size_t vb = eq + 1;
-    size_t ve = line.size();
-    while (vb < ve && IsBlank(line[vb]))
-        ++vb;
-    while (ve > vb && IsBlank(line[ve - 1]))
-        --ve;
-    if (ve - vb >= 2 && line[vb] == '"' && line[ve - 1] == '"') {
-        ++vb;
-        --ve;
-    }
     if (value)
-        value->assign(line, vb, ve - vb);
+        value->assign(v, n);
     return true;
 }
 
@@ -163,11 +280,8 @@ int KvFind(const std::vector<std::string>& lines, const std::string& key, std::s
 }
 
 int KvGet(const char* path, const std::string& key, std::string* value) {
-    std::vector<std::string> lines;
-    bool endsWithNewline;
-    if (KvLoad(path, &lines, &endsWithNewline) != 0)
-        return -1;
-    return KvFind(lines, key, value);
+    return KvLookup(path, key.data(), key.size(),
+                    [value](const char* v, size_t n) { value->assign(v, n); });
 }
 
 }  // namespace kytoplat
@@ -180,19 +294,22 @@ int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size,
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
-    std::string value;
-    int rc = kytoplat::KvGet(path, key, &value);
+    // The value goes straight from the read buffer into the caller's, cut to its size.
+    int copied = 0;
+    int rc = kytoplat::KvLookup(path, key, strlen(key), [&](const char* v, size_t n) {
+        if (n > static_cast<size_t>(size - 1))
+            n = static_cast<size_t>(size - 1);
+        memcpy(buf, v, n);
+        buf[n] = '\0';
+        copied = static_cast<int>(n);
+    });
     if (rc < 0)
         return -1;
     if (rc == 0) {
         buf[0] = '\0';
         return 0;
     }
-    size_t n =
-        value.size() < static_cast<size_t>(size - 1) ? value.size() : static_cast<size_t>(size - 1);
-    memcpy(buf, value.data(), n);
-    buf[n] = '\0';
-    return static_cast<int>(n);
+    return copied;
 } catch (...) {
     return KYTO_FAIL_ON_EXCEPTION(-1);
 }
