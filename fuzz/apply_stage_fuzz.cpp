@@ -40,5 +40,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         KYTO_FUZZ_CHECK(error == "err_system");
     else
         KYTO_FUZZ_CHECK(again == percentage);
+    kytofuzz::CheckDescriptors();
     return 0;
 }

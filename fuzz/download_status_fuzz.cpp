@@ -69,5 +69,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (ok && vyxStatus != VyxUpdate::VYX_DOWNLOAD_STATUS_DOWNLOADING &&
         vyxStatus != VyxUpdate::VYX_DOWNLOAD_STATUS_FINISHED)
         KYTO_FUZZ_CHECK(vyxPercentage == 0);
+    kytofuzz::CheckDescriptors();
     return 0;
 }

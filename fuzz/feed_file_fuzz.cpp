@@ -111,5 +111,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     KYTO_SAME_FIELD(link);
     KYTO_SAME_FIELD(checksum);
 #undef KYTO_SAME_FIELD
+    kytofuzz::CheckDescriptors();
     return 0;
 }

@@ -60,5 +60,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     } else {
         KYTO_FUZZ_CHECK(type == RSS_TAG_ITEM_TITLE);
     }
+    kytofuzz::CheckDescriptors();
     return 0;
 }

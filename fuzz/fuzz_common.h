@@ -5,6 +5,7 @@
 #ifndef KYTO_FUZZ_COMMON_H
 #define KYTO_FUZZ_COMMON_H
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -80,6 +81,25 @@ inline std::vector<std::string> SplitInput(const uint8_t* data, size_t size, con
     while (out.size() < parts)
         out.emplace_back();
     return out;
+}
+
+// Called once per run: every 4096 runs the open descriptors are counted; a reader that
+// leaks one per call would hold thousands more than at the first count.  (A descriptor
+// that a library keeps open once is no leak: a handful over the first count is allowed.)
+inline void CheckDescriptors() {
+    static long runs = 0;
+    static int first = -1;
+    if (runs++ % 4096 != 0)
+        return;
+    int n = 0;
+    DIR* d = opendir("/proc/self/fd");
+    KYTO_FUZZ_CHECK(d != nullptr);
+    while (readdir(d) != nullptr)
+        ++n;
+    closedir(d);
+    if (first < 0)
+        first = n;
+    KYTO_FUZZ_CHECK(n < first + 16);
 }
 
 // True when a fixed-size text field holds its terminating NUL.

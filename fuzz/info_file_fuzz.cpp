@@ -35,5 +35,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         KYTO_FUZZ_CHECK(percentage == 100 && status == "finished");
     else
         KYTO_FUZZ_CHECK(percentage == -7 && status == "none");  // no status file
+    kytofuzz::CheckDescriptors();
     return 0;
 }

@@ -113,5 +113,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
                         static_cast<int>(newValue.size()));
         KYTO_FUZZ_CHECK(newValue == back);
     }
+    kytofuzz::CheckDescriptors();
     return 0;
 }

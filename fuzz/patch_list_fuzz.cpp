@@ -23,5 +23,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     KYTO_FUZZ_CHECK(code >= 0 && code <= 7);
     if (!ok)
         KYTO_FUZZ_CHECK(update.GetFullVersion().empty());
+    kytofuzz::CheckDescriptors();
     return 0;
 }
