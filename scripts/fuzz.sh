@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Builds the fuzz targets (fuzz/, clang + libFuzzer, AddressSanitizer and
-# UndefinedBehaviorSanitizer) in build-f2-fuzz/ and runs each inside the test sandbox,
-# starting from the seed corpus in fuzz/corpus/<target>.  Run as root:
+# UndefinedBehaviorSanitizer) in build-fuzz/ ($KYTO_FUZZ_BUILD when set) and runs each
+# inside the test sandbox, starting from the seed corpus in fuzz/corpus/<target>.  As root:
 #
 #   bash scripts/fuzz.sh [-runs=N | -max_total_time=S] [target ...]
 #

@@ -11,8 +11,8 @@
 #   bash scripts/hardening.sh [--fuzz-seconds=S]     (default 20 s per target)
 #
 # Long runs by hand: scripts/fuzz.sh for the fuzz targets; for the stress programs
-#   build-stress/kyto-sandbox build-stress/torn_reads --rewrites=100000 --pollers=3
-#   build-stress/kyto-sandbox build-stress/crash_trials --trials=100
+#   build-stress/kyto-sandbox $PWD/build-stress/torn_reads --rewrites=100000 --pollers=3
+#   build-stress/kyto-sandbox $PWD/build-stress/crash_trials --trials=100
 set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
@@ -24,7 +24,7 @@ for arg in "$@"; do
     case "$arg" in
     --fuzz-seconds=*) FUZZ_SECONDS=${arg#*=} ;;
     -h | --help)
-        sed -n '2,16p' "$0"
+        sed -n '2,15p' "$0"
         exit 0
         ;;
     *)
