@@ -74,11 +74,11 @@ TEST_F(DebianLibTest, SmallFixNumberFromFileNameAndOrder) {
         ClearSyslog();
         EXPECT_EQ(DebianLib::FindSmallFixNumfromDeb(c.name), c.expected) << c.name;
         // Only another build is worth a log line.
-        EXPECT_EQ(SyslogContains("different buildnumber of deb [" + c.name +
-                                     "] with system buildnumber [5644]",
-                                 LOG_ERR),
-                  c.name.find("5645") != std::string::npos);
-        EXPECT_EQ(SyslogMessages().size(), c.name.find("5645") != std::string::npos ? 1u : 0u);
+        const bool otherBuild = c.name.find("5645") != std::string::npos;
+        EXPECT_EQ(otherBuild ? 1u : 0u, SyslogMessages().size()) << c.name;
+        EXPECT_EQ(otherBuild, SyslogContains("different buildnumber of deb [" + c.name +
+                                                 "] with system buildnumber [5644]",
+                                             LOG_ERR));
     }
     // The build number is read from the version file on every call.
     SetKeyValue("/etc.defaults/VERSION", "buildnumber", std::nullopt);
