@@ -3,8 +3,7 @@
 // folder, output names, the clean-up of earlier results).
 #include <string.h>
 
-#include "update_server.h"
-#include "vyxupdate.h"
+#include "engine_fixtures.h"
 
 namespace {
 
@@ -16,20 +15,7 @@ const char* kConf = "/etc.defaults/kytoinfo.conf";
 const FeedModel kMine{"demo_model", "http://h/img/mine.img", "aa11"};
 const FeedModel kOther{"other_model", "http://h/img/other.img", "bb22"};
 
-class VyxFeedTest : public SandboxTest {
-  protected:
-    // Parses the items against the provisioned 5.2 build 5644 "demo_model".
-    int Parse(const std::string& items, bool hotfixOnly = false) {
-        WriteFile(kFeed, FeedDocument(items));
-        memset(&current, 0, sizeof(current));
-        EXPECT_EQ(1, VyxUpdate::GetVyxInfo(current));
-        memset(&release, 0x55, sizeof(release));
-        return VyxUpdate::ParseRssFile(hotfixOnly, current, found, release);
-    }
-    bool found = false;
-    _tag_vyxinfo_ current;
-    _tag_vyxinfo_ release;
-};
+using VyxFeedTest = ReleaseFeedTest;
 
 TEST_F(VyxFeedTest, FirstMatchingItemWinsAndOtherModelsAreCleared) {
     ASSERT_EQ(1, Parse(FeedItem("5", "2", "5700", {kOther, kMine}) +

@@ -1,6 +1,7 @@
 // Helpers shared by the engine tests (see engine_fixtures.h).
 #include "engine_fixtures.h"
 
+#include <string.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -54,6 +55,25 @@ pid_t ReleaseServerTest::StartSlowDownload(unsigned long long bytes) {
                stat("/volume1/@autoupdate/slow.img", &st) == 0 && st.st_size > 0;
     }));
     return pid;
+}
+
+std::string VyxStatusSeen() {
+    const char* const kWords[] = {"none", "downloading", "finished", "stopped", "failed"};
+    int percentage = -1;
+    VyxUpdate::VYX_DOWNLOAD_STATUS status = VyxUpdate::VYX_DOWNLOAD_STATUS_FAILED;
+    const bool ok = VyxUpdate::GetDownloadStatus(percentage, status);
+    const int index = static_cast<int>(status);
+    return std::string(ok ? "" : "refused ") +
+           (index >= 0 && index < 5 ? kWords[index] : std::to_string(index)) + " " +
+           std::to_string(percentage);
+}
+
+int ReleaseFeedTest::Parse(const std::string& items, bool hotfixOnly) {
+    WriteFile("/var/run/autoupdate_tmp_file_RSS", FeedDocument(items));
+    memset(&current, 0, sizeof(current));
+    EXPECT_EQ(1, VyxUpdate::GetVyxInfo(current));
+    memset(&release, 0x55, sizeof(release));
+    return VyxUpdate::ParseRssFile(hotfixOnly, current, found, release);
 }
 
 std::string BuildDebName(const DebPackage& pkg, const std::string& folder) {

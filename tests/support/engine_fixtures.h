@@ -17,6 +17,7 @@
 #include "sandbox.h"
 #include "smallupdate.h"
 #include "update_server.h"
+#include "vyxupdate.h"
 
 namespace kytotest {
 
@@ -42,6 +43,22 @@ class ReleaseServerTest : public SandboxTest {
     // returns once wget runs and bytes have arrived in /volume1/@autoupdate/slow.img.
     pid_t StartSlowDownload(unsigned long long bytes);
     std::unique_ptr<UpdateServer> server;
+};
+
+// GetDownloadStatus of the release download as another process sees it: "<status>
+// <percentage>", the status as none, failed, stopped, downloading or finished, led by
+// "refused " when the call fails.
+std::string VyxStatusSeen();
+
+// The release feed reader against the provisioned 5.2 build 5644 "demo_model".
+class ReleaseFeedTest : public SandboxTest {
+  protected:
+    // Writes a feed of the items where the check fetches it and parses it into `release`
+    // (filled with 0x55 first), with `found` and `current` as the check passes them.
+    int Parse(const std::string& items, bool hotfixOnly = false);
+    bool found = false;
+    _tag_vyxinfo_ current;
+    _tag_vyxinfo_ release;
 };
 
 // ---- Small update ------------------------------------------------------------------------
