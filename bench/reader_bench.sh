@@ -11,9 +11,11 @@
 #                      the library starts it;
 #   feed_bench         VyxUpdate::ParseRssFile on a generated 107 MB feed against
 #                      grep -c '<model>' over the same file.
-# Each prints its ratios at the end.
+# Each prints its ratios at the end.  "check" runs instead the differential check of the
+# feed reader against its plain reference (bench/feed_reader_check.cpp) on FEEDS feeds.
 #
 # Usage: bench/reader_bench.sh [polls|feed|all] [Google Benchmark options...]   (needs root)
+#        bench/reader_bench.sh check [FEEDS [SEED]]
 set -euo pipefail
 
 SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
@@ -21,14 +23,15 @@ SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 if [ "${1:-}" != "--inside" ]; then
     WHAT=${1:-all}
     shift || true
-    case "$WHAT" in polls | feed | all) ;; *)
-        echo "usage: $0 [polls|feed|all] [benchmark options...]" >&2
+    case "$WHAT" in polls | feed | all | check) ;; *)
+        echo "usage: $0 [polls|feed|all] [benchmark options...] | check [FEEDS [SEED]]" >&2
         exit 2
         ;;
     esac
     BUILD="$SRC/build-bench"
     cmake -S "$SRC" -B "$BUILD" -DCMAKE_BUILD_TYPE=Release -DKYTO_BUILD_BENCH=ON >/dev/null
-    cmake --build "$BUILD" -j2 --target kyto-sandbox status_poll_bench feed_bench >/dev/null
+    cmake --build "$BUILD" -j2 --target kyto-sandbox status_poll_bench feed_bench \
+        feed_reader_check >/dev/null
     exec "$BUILD/tests/kyto-sandbox" /bin/bash "$SRC/bench/reader_bench.sh" --inside \
         "$BUILD" "$WHAT" "$@"
 fi
@@ -38,6 +41,10 @@ BUILD=$2
 WHAT=$3
 shift 3
 cd /
+
+if [ "$WHAT" = check ]; then
+    exec "$BUILD/bench/feed_reader_check" "$@"
+fi
 
 if [ "$WHAT" != feed ]; then
     mkdir -p /volume1 /srv/bench
