@@ -186,8 +186,7 @@ int main(int argc, char** argv) {
          BaselineSmall, 3.75},
         {"SmallUpdate::GetApplyStage", "open+read+close apply status", PollApply, BaselineApply,
          3.75},
-        {"KLIBCFileGetKeyValue", "open+read+close download status (small)", KeyRead, nullptr,
-         1.25},
+        {"KLIBCFileGetKeyValue", "open+read+close download status (small)", KeyRead, nullptr, 1.25},
     };
     for (const Pair& p : pairs) {
         benchmark::RegisterBenchmark(p.reader, p.poll)->Unit(benchmark::kMicrosecond);
