@@ -13,20 +13,7 @@ using namespace kytotest;
 const std::string kDebDir = "/volume1/@smallupd@te_deb";
 const char *kStaging = "/smallupd@te/", *kApplyStatus = "/var/run/applySmallUpd@te.status",
            *kOrderLog = "/tmp/install_order.log";
-// clang-format off
-const char* const kWords[] = {"none", "waiting_remote_upgrading", "analying", "program",
-                              "startService", "finished", "reboot"};
-// clang-format on
-
-class SmallUpdateApplyTest : public SandboxTest {
-  protected:
-    void SetUp() override {
-        SandboxTest::SetUp();
-        Shell("mkdir -p " + kDebDir);
-        u.m_debDir = kDebDir;
-    }
-    SmallUpdate u;
-};
+using SmallUpdateApplyTest = ApplyStepsTest;
 
 TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
     ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(53, SmallUpdate::APPLY_STAGE_PROGRAM, "a b"));
@@ -40,7 +27,8 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
     // Every stage has its word; an empty ErrMsg leaves the caller's text.
     for (int stage = 0; stage <= 6; ++stage) {
         ASSERT_TRUE(SmallUpdate::UpdateApplyProgress(stage, SmallUpdate::APPLY_STAGE(stage), ""));
-        EXPECT_EQ(std::to_string(stage) + " " + kWords[stage] + " caller-err", ApplyStageSeen());
+        EXPECT_EQ(std::to_string(stage) + " " + kApplyStageWords[stage] + " caller-err",
+                  ApplyStageSeen());
     }
     // Files written by others, missing (nullptr) or incomplete.  Stages beyond the table
     // (negative ones too) keep the caller's word and report an error.
@@ -63,7 +51,7 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
 TEST_F(SmallUpdateApplyTest, PollerInAnotherProcessNeverSeesATornFile) {
     auto stageFor = [](int p) { return static_cast<SmallUpdate::APPLY_STAGE>(2 + p % 5); };
     auto seenFor = [&](int p) {
-        return std::to_string(p) + " " + kWords[stageFor(p)] + " e" + std::to_string(p);
+        return std::to_string(p) + " " + kApplyStageWords[stageFor(p)] + " e" + std::to_string(p);
     };
     auto write = [&](int i) {
         return SmallUpdate::UpdateApplyProgress(i % 101, stageFor(i % 101),

@@ -101,6 +101,16 @@ std::string ApplyDeb(const std::string& name, int fix, bool fails,
     return BuildDebName(pkg, "/volume1/@smallupd@te_deb");
 }
 
+const char* const kApplyStageWords[7] = {
+    "none",  "waiting_remote_upgrading", "analying", "program", "startService", "finished",
+    "reboot"};
+
+void ApplyStepsTest::SetUp() {
+    SandboxTest::SetUp();
+    Shell("mkdir -p /volume1/@smallupd@te_deb");
+    u.m_debDir = "/volume1/@smallupd@te_deb";
+}
+
 SmallUpdate DumpableRecord() {
     SmallUpdate u;
     u.m_buildNumber = 5644;

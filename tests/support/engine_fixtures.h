@@ -74,6 +74,14 @@ std::string ApplyStageSeen();
 // status file holds then; a failing package's postinst exits 1 instead.
 std::string ApplyDeb(const std::string& name, int fix, bool fails = false,
                      const std::map<std::string, std::string>& files = {});
+// The words GetApplyStage reports for the stages 0 to 6.
+extern const char* const kApplyStageWords[7];
+// The apply's steps on a record `u` whose package folder "/volume1/@smallupd@te_deb" exists.
+class ApplyStepsTest : public SandboxTest {
+  protected:
+    void SetUp() override;
+    SmallUpdate u;
+};
 // A record for build 5644, fix 7, that dumps cleanly: one small-update package with its link,
 // package folder "/volume1/d".
 SmallUpdate DumpableRecord();

@@ -21,6 +21,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <cmath>
 #include <set>
 #include <sstream>
 #include <thread>
@@ -401,6 +402,20 @@ std::vector<std::string> FileLines(const std::string& path, const std::string& o
     for (const std::string& line : SplitLines(ReadFile(path).value_or(""))) {
         if (line.find(onlyWith) != std::string::npos)
             out.push_back(line);
+    }
+    return out;
+}
+
+std::vector<std::string> StampedLines(const std::string& path) {
+    std::vector<std::string> out;
+    for (const std::string& line : FileLines(path)) {
+        struct tm tm = {};
+        const char* rest = strptime(line.c_str(), "%Y/%m/%d %H:%M:%S", &tm);
+        if (line.size() < 20 || line[4] != '/' || rest != line.c_str() + 19 || *rest != '\t')
+            continue;
+        tm.tm_isdst = -1;
+        if (std::abs(difftime(time(nullptr), mktime(&tm))) <= 120.0)
+            out.push_back(rest + 1);
     }
     return out;
 }

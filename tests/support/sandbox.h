@@ -89,6 +89,9 @@ void SetKeyValue(const std::string& path, const std::string& key,
 
 // Lines of a file (without their newline), only those containing `onlyWith` when given.
 std::vector<std::string> FileLines(const std::string& path, const std::string& onlyWith = "");
+// The lines of a log file that carry a local time stamp "YYYY/MM/DD HH:MM:SS" and a tab,
+// stamped within two minutes of now, without the stamp and the tab; other lines skipped.
+std::vector<std::string> StampedLines(const std::string& path);
 // Permission bits (07777) of path; fails the test and returns 0 when stat fails.
 mode_t ModeOf(const std::string& path);
 // Parses JSON text (strict: the whole text is one value); fails the test when it cannot.
