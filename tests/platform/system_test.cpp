@@ -29,8 +29,9 @@ TEST_F(SystemTest, LastErrorIsPerThreadAndSuccessLeavesItAlone) {
     EXPECT_EQ(KLIBCErrorGetLine(), 42);
 }
 
+// The event log's lines are seen in the release download's tests; here: the update log's file
+// and a log file that cannot be written.
 TEST_F(SystemTest, ErrLogSetAppendsLinesAndEventLogAlsoGoesToSyslog) {
-    // What is written is seen in the update log and the event log of the engine tests.
     mode_t old = umask(0);
     EXPECT_EQ(KLIBCErrLogSet("/tmp/err.log", ""), 0);
     umask(old);
@@ -38,12 +39,8 @@ TEST_F(SystemTest, ErrLogSetAppendsLinesAndEventLogAlsoGoesToSyslog) {
     EXPECT_EQ(ModeOf("/tmp/err.log"), 0644u);
     EXPECT_EQ(KLIBCErrLogSet("/tmp/log/err.log", "x"), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_FILE_NOT_FOUND);
-    EXPECT_EQ(KLIBCErrLogSet("/tmp/err.log", nullptr), -1);
-    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
-    EXPECT_EQ(KYTOLogSet1(1, 2, 0x11300042, "update", "5.2-5644", nullptr, "done"), 0);
-    EXPECT_EQ(ReadFile(KYTO_EVENT_LOG_PATH), "1 2 0x11300042 update 5.2-5644  done\n");  // null: ""
-    // A folder in place of the log file: an error, but syslog still gets the line.
-    ASSERT_EQ(unlink(KYTO_EVENT_LOG_PATH), 0);
+    // A folder in place of the event log: an error, but syslog still gets the line.
+    RemoveTree(KYTO_EVENT_LOG_PATH);
     ASSERT_EQ(mkdir(KYTO_EVENT_LOG_PATH, 0755), 0);
     EXPECT_EQ(KYTOLogSet1(4, 1, 0xFFFFFFFF, "a", "b", "c", "d"), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_FILE_OPEN);
@@ -107,12 +104,9 @@ TEST_F(SystemTest, MkdirPCreatesMissingParents) {
     EXPECT_EQ(KYTOFSMkdirP("/tmp/a/b//c/", 0750), 0);
     umask(old);
     EXPECT_EQ(ModeOf("/tmp/a/b/c"), 0750u);
-    EXPECT_EQ(KYTOFSMkdirP("/tmp/a/b/c", 0755), 0);  // already there
     WriteFile("/tmp/a/file", "x");
     EXPECT_EQ(KYTOFSMkdirP("/tmp/a/file/sub", 0755), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_SYSTEM);
-    EXPECT_EQ(KYTOFSMkdirP("", 0755), -1);
-    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
 }
 
 TEST_F(SystemTest, HighAvailabilityState) {
@@ -121,7 +115,6 @@ TEST_F(SystemTest, HighAvailabilityState) {
     struct Case { const char* content; int running, hybrid; const char* partner; } cases[] = {
         {nullptr, 0, 0, ""}, {"running=\"YES\"\n#running=\"yes\"\n", 0, 0, ""},
         {"running=yes\nhybrid_dl=\"yes\"\npartner_unique=\"abcdefghijklmnop\"\n", 1, 1, "abcdefg"},
-        {"hybrid_dl=\"no\"\npartner_unique=\"model_b\"\n", 0, 0, ""},
         {"hybrid_dl=\"yes\"\npartner_unique=\"\"\n", 0, -1, ""}, {"/", 0, -1, ""}};
     // clang-format on
     for (const Case& c : cases) {
@@ -134,12 +127,10 @@ TEST_F(SystemTest, HighAvailabilityState) {
         EXPECT_EQ(KYTOHAIsHybridDL(buf, sizeof buf), c.hybrid);
         EXPECT_STREQ(buf, c.partner);
     }
-    EXPECT_EQ(KYTOHAIsHybridDL(nullptr, 8), -1);
-    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
 }
 
-// Stop and start order is seen through the engine's service switch; here: which names count
-// as start-up scripts, failures that do not stop the walk, the third-party tool's result.
+// Order and the third-party tool's success are seen through the engine's service switch; here:
+// which names count as start-up scripts, failures that do not stop the walk, the tool's result.
 TEST_F(SystemTest, ServicesRunOnlyStartScriptsAndThirdPartyResultsCount) {
     std::string recorder = *ReadFile("/usr/kyto/bin/kytopkg");
     for (const char* name : {"S50extra.sh", "K10old.sh", "S30notes.txt", "xS40.sh"})
@@ -147,7 +138,6 @@ TEST_F(SystemTest, ServicesRunOnlyStartScriptsAndThirdPartyResultsCount) {
     WriteFile("/var/run/fake-exit/S20samba.sh", "3");  // a failing script stops nothing
     ClearRecordedCalls();
     EXPECT_EQ(KYTOServiceOnOffALL(KYTO_SERVICE_STOP_ALL), 0);
-    EXPECT_EQ(KYTOServiceThirdPartyAll(1), 0);
     WriteFile("/var/run/fake-exit/kytopkg", "4");
     EXPECT_EQ(KYTOServiceThirdPartyAll(0), 4);
     std::string calls;
@@ -155,7 +145,7 @@ TEST_F(SystemTest, ServicesRunOnlyStartScriptsAndThirdPartyResultsCount) {
         calls += call.at(0) + " " + call.at(1) + ";";
     EXPECT_EQ(calls,
               "S99sshd.sh stop;S50extra.sh stop;S20samba.sh stop;S01iptables.sh stop;"
-              "kytopkg startall;kytopkg stopall;");
+              "kytopkg stopall;");
     EXPECT_EQ(KYTOServiceOnOffALL(3), -1);
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
     ASSERT_EQ(Shell("rm -r /usr/kyto/etc/rc.d /usr/kyto/bin/kytopkg"), 0);

@@ -46,12 +46,13 @@ TEST_F(VyxServerTest, CheckAsksOnceAndTheDefaultServerWithoutSetting) {
 TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
     const std::string image = "/volume9/@autoupdate/old.img",
                       versions = R"("majorversion":"5","minorversion":"2","patchPath":")" + image;
+    // The info file, which of the info and progress files stay (images always do).
     // clang-format off
-    struct Case { std::string info; bool infoKept, progressCleared; } cases[] = {
-        {R"({"updateType":"vyxupdate","buildnumber":"100",)" + versions + "\"}", false, true},
-        {R"({"buildnumber":"0x1644",)" + versions + "\"}", true, false},  // same build in hex
-        {R"({"updateType":"smallupdate","buildnumber":"1"})", true, false},
-        {R"({"updateType":"vyxupdate","buildnumber":"5700"})", false, false}};  // no patchPath
+    struct Case { std::string info, left; } cases[] = {
+        {R"({"updateType":"vyxupdate","buildnumber":"100",)" + versions + "\"}", "image"},
+        {R"({"buildnumber":"0x1644",)" + versions + "\"}", "info progress image"},  // hex
+        {R"({"updateType":"smallupdate","buildnumber":"1"})", "info progress image"},
+        {R"({"updateType":"vyxupdate","buildnumber":"5700"})", "progress image"}};  // no patchPath
     // clang-format on
     ServeFeed({{"demo_model", "http://h/demo.img", "00ff"}});
     for (const Case& c : cases) {
@@ -61,9 +62,11 @@ TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
         WriteFile(kProgress, "Length: 7");
         bool haveNew = false;
         ASSERT_EQ(1, VyxUpdate().CheckNewRelease(haveNew));
-        EXPECT_EQ(c.infoKept, PathExists(kInfo));
-        EXPECT_TRUE(PathExists(image));  // images are never deleted by the check
-        EXPECT_EQ(c.progressCleared, !PathExists(kProgress));
+        std::string left;
+        for (const auto& [file, name] : std::map<std::string, std::string>{
+                 {kInfo, " info"}, {kProgress, " progress"}, {image, " image"}})
+            left += PathExists(file) ? name : "";
+        EXPECT_EQ(" " + c.left, left);
     }
 }
 
@@ -117,17 +120,12 @@ TEST_F(VyxServerTest, CancelBetweenRetriesEndsThem) {
 }
 
 TEST_F(VyxServerTest, FailedDownloadsNotifyAndLogTheEvent) {
-    for (int failures : {9, 10}) {
-        const std::string path = "/images/f" + std::to_string(failures) + ".img";
-        ClearRecordedCalls();
-        ServeFeed({Image("demo_model", path, 4096)});
-        server->FailPath(path, 503, failures);
-        EXPECT_EQ(failures < 10 ? 1 : 0, VyxUpdate().DownloadVyx()) << failures;
-        EXPECT_EQ(10u, server->RequestsFor(path).size()) << failures;  // ten attempts at most
-    }
-    EXPECT_TRUE(SyslogContains("Fail to download patch file"));
-    EXPECT_EQ(DownloadNotification(false), RecordedCalls());
-    EXPECT_TRUE(EventLogged("1 3 0x11B01022    \n"));  // no image was complete: no path
+    // Ten failed attempts are the fault test's case; the tenth attempt may still succeed.
+    ServeFeed({Image("demo_model", "/images/f9.img", 4096)});
+    server->FailPath("/images/f9.img", 503, 9);
+    EXPECT_EQ(1, VyxUpdate().DownloadVyx());
+    EXPECT_EQ(10u, server->RequestsFor("/images/f9.img").size());
+    ClearRecordedCalls();
 
     FeedModel image = Image("demo_model", "/images/vyx.img", 8192);
     for (char& ch : image.sum)

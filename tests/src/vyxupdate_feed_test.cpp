@@ -82,10 +82,6 @@ TEST_F(VyxFeedTest, ScannerAcceptsOnlyWellFormedBoundedLinesAndKeepsTheKind) {
         EXPECT_EQ(c.kind, kind);
     }
     EXPECT_TRUE(SyslogContains("Left tag [MajorVer] and right tag [MinorVer] don't match"));
-    // The longest value the scanner accepts still fits the record's field.
-    _tag_vyxinfo_ info;
-    VyxUpdate::SetVyxInfo(RSS_TAG_M_LINK, v4096.c_str(), info);
-    EXPECT_EQ(4095u, strlen(info.link));
 }
 
 // An info object of any shape is judged without throwing and without gaining members.
@@ -127,14 +123,10 @@ TEST_F(VyxLocationTest, FreeSpaceBoundaries) {
 TEST_F(VyxLocationTest, DownloadFolderOnAVolumeWithMoreThanTheMinimumElseRoot) {
     MountVolume("/volume1", kMin);               // exactly the minimum: not offered
     MountVolume("/volume2", 1024 * kMiB, true);  // read-only: not offered
-    std::string folder, path;
+    std::string folder;
     ASSERT_EQ(1, VyxUpdate::PrepareDownloadEnv(folder));
     EXPECT_EQ("//@autoupdate", folder);
-    MountVolume("/volume3", kMin + kPage);
-    ASSERT_TRUE(VyxUpdate::FindDownloadVolume(path));
-    EXPECT_EQ("/volume3", path);
-    UnmountVolume("/volume3");  // room for the files written below
-    MountVolume("/volume3", 300 * kMiB);
+    MountVolume("/volume3", 300 * kMiB);  // more than the minimum: the platform's volume test
 
     // Earlier results are cleared, earlier images kept; a stray file makes way for a 0700
     // folder; a folder that cannot be made fails.
