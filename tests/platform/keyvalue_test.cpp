@@ -120,14 +120,4 @@ TEST_F(KeyValueTest, ReaderInAnotherProcessNeverSeesATornOrMissingFile) {
     EXPECT_EQ(ListDir("/tmp/kv"), Names{"test.conf"});
 }
 
-TEST_F(KeyValueTest, FileExistFollowsLinks) {
-    WriteFile(kFile, "");
-    ASSERT_EQ(symlink(kFile, "/tmp/kv/link"), 0);
-    ASSERT_EQ(symlink("/tmp/kv/none", "/tmp/kv/dangling"), 0);
-    EXPECT_EQ(KLIBCFileExist("/tmp/kv") + KLIBCFileExist("/tmp/kv/link"), 2);
-    EXPECT_EQ(KLIBCFileExist("/tmp/kv/dangling") + KLIBCFileExist("/tmp/kv/none"), 0);
-    EXPECT_EQ(KLIBCFileExist(nullptr), 0);
-    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
-}
-
 }  // namespace

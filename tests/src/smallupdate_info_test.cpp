@@ -9,12 +9,6 @@ using namespace kytotest;
 const char *kInfo = "/autoupd@te.info", *kPassive = "/passive_upd@te.info";
 using Change = std::function<void(SmallUpdate&)>;
 
-// An info file as a download on the sandbox's build 5644 writes it.
-const char* const kValidInfo =
-    R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
-    R"("debDir":"/volume1/d","smallupdateDeb":"smallfix_6.1-5644-s3_all.deb",)"
-    R"("vyxServiceRestartList":["S20samba.sh"],"pkgRestartList":[]})";
-
 using SmallUpdateInfoTest = SandboxTest;
 
 TEST_F(SmallUpdateInfoTest, EqualIgnoresIdentityLinksAndListOrder) {
@@ -54,12 +48,7 @@ TEST_F(SmallUpdateInfoTest, ImportRejectsBadFiles) {
     // clang-format on
     for (const Row& row : rows) {
         SCOPED_TRACE(std::string(row.key) + "=" + (row.json ? row.json : "(none)"));
-        Json::Value v = ParseJson(kValidInfo);
-        if (row.json)
-            v[row.key] = ParseJson(row.json);
-        else
-            v.removeMember(row.key);
-        WriteFile(kInfo, Json::FastWriter().write(v));
+        WriteSmallInfo({{row.key, row.json}});
         ClearSyslog();
         SmallUpdate u;
         u.m_installDebs = {"kept"};  // the list is taken only when every package passes
@@ -117,17 +106,15 @@ TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
     EXPECT_TRUE(back.Equal(u) && back.GetErrno() == 0);
 
     // Reboot flag only, no installDeb: lists emptied; a flash flag set before is kept.
-    WriteFile(kInfo, R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
-                     R"("debDir":"/d","smallupdateDeb":"s.deb","blNeedReboot":true})");
+    WriteSmallInfo({{"blNeedReboot", "true"},
+                    {"vyxServiceRestartList", nullptr},
+                    {"pkgRestartList", nullptr}});
     ASSERT_TRUE(back.ImportInfoFile(kInfo));
     EXPECT_TRUE(back.m_installDebs.empty() && back.m_pkgRestartList.empty());
     EXPECT_TRUE(back.m_blNeedReboot && back.m_blFlashUpdate && !back.m_blConfigUpdate);
     // Optional members convert as jsoncpp does (1 reads as true); an array for a text reads
     // as empty instead of throwing ("yes" for a flag: the patch-list merge's test).
-    Json::Value v = ParseJson(kValidInfo);
-    v["blNeedReboot"] = 1;
-    v["installDeb"] = v["smallupdateDeb"] = Json::Value(Json::arrayValue);
-    WriteFile(kInfo, Json::FastWriter().write(v));
+    WriteSmallInfo({{"blNeedReboot", "1"}, {"installDeb", "[]"}, {"smallupdateDeb", "[]"}});
     EXPECT_NO_THROW(EXPECT_TRUE(back.ImportInfoFile(kInfo)));
     EXPECT_TRUE(back.m_blNeedReboot && back.m_smallUpdateDeb.empty());
 

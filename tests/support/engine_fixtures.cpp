@@ -111,6 +111,20 @@ void ApplyStepsTest::SetUp() {
     u.m_debDir = "/volume1/@smallupd@te_deb";
 }
 
+void WriteSmallInfo(const std::vector<std::pair<std::string, const char*>>& changes) {
+    Json::Value info =
+        ParseJson(R"({"updateType":"smallupdate","buildnumber":5644,"newSmallFixNumber":3,)"
+                  R"("debDir":"/volume1/d","smallupdateDeb":"smallfix_6.1-5644-s3_all.deb",)"
+                  R"("vyxServiceRestartList":["S20samba.sh"],"pkgRestartList":[]})");
+    for (const auto& [key, value] : changes) {
+        if (value)
+            info[key] = ParseJson(value);
+        else
+            info.removeMember(key);
+    }
+    WriteFile("/autoupd@te.info", Json::FastWriter().write(info));
+}
+
 SmallUpdate DumpableRecord() {
     SmallUpdate u;
     u.m_buildNumber = 5644;

@@ -82,6 +82,10 @@ class ApplyStepsTest : public SandboxTest {
     void SetUp() override;
     SmallUpdate u;
 };
+// Writes "/autoupd@te.info" as a download on build 5644 writes it (fix 3, package folder
+// "/volume1/d", the small-update package, "S20samba.sh" to restart, no packages to restart),
+// each change setting a member to JSON text or removing it (nullptr).
+void WriteSmallInfo(const std::vector<std::pair<std::string, const char*>>& changes = {});
 // A record for build 5644, fix 7, that dumps cleanly: one small-update package with its link,
 // package folder "/volume1/d".
 SmallUpdate DumpableRecord();
