@@ -99,16 +99,6 @@ TEST_F(SystemTest, OnlyWritableDataVolumesWithMoreThanTheMinimum) {
     EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_BAD_PARAMETER);
 }
 
-TEST_F(SystemTest, MkdirPCreatesMissingParents) {
-    mode_t old = umask(0);
-    EXPECT_EQ(KYTOFSMkdirP("/tmp/a/b//c/", 0750), 0);
-    umask(old);
-    EXPECT_EQ(ModeOf("/tmp/a/b/c"), 0750u);
-    WriteFile("/tmp/a/file", "x");
-    EXPECT_EQ(KYTOFSMkdirP("/tmp/a/file/sub", 0755), -1);
-    EXPECT_EQ(KLIBCErrGet(), KYTO_ERR_SYSTEM);
-}
-
 TEST_F(SystemTest, HighAvailabilityState) {
     // content nullptr: no file; "/": a folder in its place.
     // clang-format off

@@ -106,11 +106,5 @@ TEST_F(CustomBugFixTest, BadProjListsAreRefused) {
     EXPECT_TRUE(SyslogMessages().empty());
 }
 
-TEST(CustomBugFixFind, ComparesWholeStrings) {
-    std::vector<std::string> list = {"S20samba.sh", "S99sshd.sh", ""};
-    EXPECT_EQ(CustomBugFix::Find(list, ""), 1);
-    EXPECT_EQ(CustomBugFix::Find(list, "S20samba"), 0);
-}
-
 }  // namespace
 }  // namespace kytotest

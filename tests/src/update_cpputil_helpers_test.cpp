@@ -43,24 +43,6 @@ TEST_F(UpdateUtilTest, BrokenJsonFilesAreDeletedAndDumpsRewriteInPlace) {
     EXPECT_TRUE(SyslogContains(" Failed to open /tmp/no/dir/x.json", LOG_ERR));
 }
 
-// Lists are written and compared through the record's dump and Equal tests.
-TEST_F(UpdateUtilTest, JsonArraysToStringLists) {
-    auto json = ParseJson;
-    // clang-format off
-    struct Case { Json::Value input; int result; Strings out; const char* message; } cases[] = {
-        {json("{\"k\":\"v\"}"), 0, {}, " bad parameter!"}, {json("[\"a\", 1]"), 0, {}, " not a string"},
-        {json("[]"), 1, {}, nullptr}, {json("[\"b\", \"a\"]"), 1, {"b", "a"}, nullptr}};
-    // clang-format on
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.input.toStyledString());
-        ClearSyslog();
-        Strings out = {"stale"};
-        EXPECT_EQ(UpdateUtil::JsonArray2StringVector(c.input, out), c.result);
-        EXPECT_EQ(out, c.out);
-        EXPECT_EQ(SyslogContains(c.message ? c.message : "update_cpputil", LOG_ERR), !!c.message);
-    }
-}
-
 constexpr unsigned long k200MiB = 209715200UL;
 
 TEST_F(UpdateUtilTest, UntarKeepsPermissionsAndFoldersAreCleaned) {
