@@ -76,11 +76,7 @@ TEST_F(ProcessTest, AliveAndKillFollowThePidInTheFile) {
 
     // The plain kill sends SIGTERM, the forced one SIGKILL; a reaped process is gone.
     for (int force : {0, 1}) {
-        pid_t child = Spawn([] {
-            for (;;)
-                pause();
-            return 0;
-        });
+        pid_t child = SpawnIdle();
         WriteFile(kPidFile, std::to_string(child));
         EXPECT_EQ(KLIBCIsProcAlive(kPidFile), 1);
         EXPECT_EQ(KLIBCKill(kPidFile, force), 0);

@@ -159,12 +159,7 @@ TEST_F(VyxServerTest, HybridPairFetchesBothImagesAndALiveDownloadIsNotRepeated) 
     ClearRecordedCalls();
     Shell("rm /var/run/kytoha.status /autoupd@te.info");
     ServeFeed({{"demo_model", server->Url("/images/vyx.img"), "00"}});
-    WriteFile(kStatus,
-              "updateType=\"vyxupdate\"\ndownloadStatus=\"downloading\"\n"
-              "downloadCount=\"1\"\ndownloadNum=\"1\"\npatchPath=\"/volume1/part.img\"\n");
-    WriteFile("/volume1/part.img", "part");
-    WriteFile(kProgress, "Length: 100 [x]\n");
-    WriteFile(kPid, std::to_string(getpid()));
+    WriteLiveVyxDownload();
     EXPECT_EQ(1, VyxUpdate().DownloadVyx());
     EXPECT_EQ(0u, server->RequestsFor("/images/vyx.img").size());
     EXPECT_FALSE(PathExists(kStatus) || PathExists(kPid));

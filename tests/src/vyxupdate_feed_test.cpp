@@ -160,29 +160,23 @@ TEST_F(VyxLocationTest, DownloadFolderOnAVolumeWithMoreThanTheMinimumElseRoot) {
 // other models' places (the root with a marker of the storage kind, or the first USB mount
 // with room when there are no internal disks).
 TEST_F(VyxLocationTest, PlaceForSuppliedImage) {
-    auto place = [] {
-        std::string path;
-        bool sufficient = false;
-        const int rc = VyxUpdate::GetVolumePathForPatch(path, sufficient);
-        return std::to_string(rc) + " " + path + (sufficient ? " sufficient" : "");
-    };
-    EXPECT_EQ("0 ", place());
+    EXPECT_EQ("0 ", SuppliedImagePlace());
     MountVolume("/volume2", 300 * kMiB);
     MountVolume("/volume3", 5 * 1024 * kMiB);
-    EXPECT_EQ("1 /volume2", place());
+    EXPECT_EQ("1 /volume2", SuppliedImagePlace());
     UnmountVolume("/volume2");
-    EXPECT_EQ("1 /volume3 sufficient", place());
+    EXPECT_EQ("1 /volume3 sufficient", SuppliedImagePlace());
     for (const auto& [storage, marker] :
          {std::pair{"supportraid", "0\n"}, {"support_buildin_storage", "1\n"}}) {
         SetKeyValue(kConf, storage, "YES");
-        const std::string root = place().substr(0, 3);  // before the marker is read
+        const std::string root = SuppliedImagePlace().substr(0, 3);  // before the marker is read
         EXPECT_EQ("1 / " + std::string(marker), root + " " + *ReadFile("/.upgrade_vol"));
         SetKeyValue(kConf, storage, "no");
     }
     SetKeyValue(kConf, "maxdisks", "0");
     MountVolume("/volumeUSB1", 100 * kMiB);
     MountVolume("/volumeUSB2", 300 * kMiB);
-    EXPECT_EQ("1 /volumeUSB2", place());
+    EXPECT_EQ("1 /volumeUSB2", SuppliedImagePlace());
 }
 
 }  // namespace

@@ -68,6 +68,22 @@ std::string VyxStatusSeen() {
            std::to_string(percentage);
 }
 
+void WriteLiveVyxDownload() {
+    WriteFile("/var/run/downloadVYX.status",
+              "updateType=\"vyxupdate\"\ndownloadStatus=\"downloading\"\n"
+              "downloadCount=\"1\"\ndownloadNum=\"1\"\npatchPath=\"/volume1/part.img\"\n");
+    WriteFile("/volume1/part.img", "part");
+    WriteFile("/var/run/downloadprogress", "Length: 100 [x]\n");
+    WriteFile("/var/run/downloadVYX.pid", std::to_string(getpid()));
+}
+
+std::string SuppliedImagePlace() {
+    std::string path;
+    bool sufficient = false;
+    const int rc = VyxUpdate::GetVolumePathForPatch(path, sufficient);
+    return std::to_string(rc) + " " + path + (sufficient ? " sufficient" : "");
+}
+
 int ReleaseFeedTest::Parse(const std::string& items, bool hotfixOnly) {
     WriteFile("/var/run/autoupdate_tmp_file_RSS", FeedDocument(items));
     memset(&current, 0, sizeof(current));

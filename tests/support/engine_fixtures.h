@@ -50,6 +50,12 @@ class ReleaseServerTest : public SandboxTest {
 // "refused " when the call fails.
 std::string VyxStatusSeen();
 
+// Writes the shared files of a release download in progress into /volume1 whose wget is
+// this process: status file, partial image, progress log and pid file.
+void WriteLiveVyxDownload();
+// What GetVolumePathForPatch answers: "<result> <path>", with " sufficient" when it says so.
+std::string SuppliedImagePlace();
+
 // The release feed reader against the provisioned 5.2 build 5644 "demo_model".
 class ReleaseFeedTest : public SandboxTest {
   protected:

@@ -474,6 +474,14 @@ pid_t Spawn(const std::function<int()>& fn) {
     return pid;
 }
 
+pid_t SpawnIdle() {
+    return Spawn([] {
+        for (;;)
+            pause();
+        return 0;
+    });
+}
+
 int Wait(pid_t pid) {
     int status = 0;
     while (waitpid(pid, &status, 0) < 0) {

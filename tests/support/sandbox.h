@@ -111,6 +111,8 @@ void UnmountVolume(const std::string& mountPoint);
 
 // Runs fn in a forked child and returns the child's pid; the child exits with fn's result.
 pid_t Spawn(const std::function<int()>& fn);
+// Starts a child that only waits for signals; returns its pid.
+pid_t SpawnIdle();
 // Waits for pid; returns its exit status, or 128 + signal when it was killed.
 int Wait(pid_t pid);
 // Runs a shell command; returns its exit status; output (stdout+stderr) when asked.
