@@ -32,7 +32,6 @@ TEST_F(SmallUpdateApplyTest, StatusFileWriterAndReader) {
     // clang-format off
     const std::pair<const char*, const char*> rows[] = {
         {"percentage=\"40\"\nstage=\"7\"\nErrMsg=\"\"\n", "40 caller-stage err_system"},
-        {"percentage=\"40\"\nstage=\"9\"\nErrMsg=\"disk full\"\n", "40 caller-stage disk full"},
         {nullptr, "-7 none caller-err"}, {"stage=\"3\"\nErrMsg=\"\"\n", "-7 none err_system"},
         {"percentage=\"30\"\n", "-7 none err_system"}};
     // clang-format on

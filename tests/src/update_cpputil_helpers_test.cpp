@@ -26,8 +26,6 @@ TEST_F(UpdateUtilTest, BrokenJsonFilesAreDeletedAndDumpsRewriteInPlace) {
         EXPECT_FALSE(PathExists(path));
         EXPECT_TRUE(SyslogContains("update_cpputil:", LOG_ERR) && SyslogContains(" Parse failed"));
     }
-    EXPECT_EQ(UpdateUtil::ParseJsonRootFromFile("/tmp/absent.json", scratch), 0);
-    EXPECT_TRUE(SyslogContains(" inFile failed", LOG_ERR));
 
     // Rewritten in place: a second name of the same file sees the new, shorter text.
     WriteFile(path, std::string(4096, 'x'));
@@ -71,7 +69,6 @@ TEST_F(UpdateUtilTest, FirstWritableDataVolumeWithEnoughRoomWinsElseRoot) {
     EXPECT_EQ(walk(ULONG_MAX, true), "0 unchanged");
     EXPECT_TRUE(SyslogContains(" sad.. / do not have sufficient size.", LOG_ERR));
     EXPECT_EQ(walk(1, true), "1 /");
-    EXPECT_TRUE(SyslogContains(" We get / to upgrade.", LOG_INFO));
     MountVolume("/volumeUSB1", 2 * k200MiB);  // not a data volume
     MountVolume("/volume1", 2 * k200MiB, /*readOnly=*/true);
     MountVolume("/volume2", k200MiB);

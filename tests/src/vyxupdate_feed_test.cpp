@@ -8,7 +8,6 @@
 namespace {
 
 using namespace kytotest;
-const char* kFeed = "/var/run/autoupdate_tmp_file_RSS";
 constexpr unsigned long long kMiB = 1024ULL * 1024ULL, kMin = 200 * kMiB, kPage = 4096ULL;
 const char* kConf = "/etc.defaults/kytoinfo.conf";
 
@@ -24,11 +23,6 @@ TEST_F(VyxFeedTest, FirstMatchingItemWinsAndOtherModelsAreCleared) {
     EXPECT_EQ("5700 demo_model http://h/img/mine.img aa11",
               std::string(release.buildNum) + " " + release.unique + " " + release.link + " " +
                   release.checksum);
-
-    unlink(kFeed);
-    EXPECT_EQ(0, VyxUpdate::ParseRssFile(false, current, found, release));
-    EXPECT_TRUE(found);  // untouched
-    EXPECT_TRUE(SyslogContains("Fail to open [/var/run/autoupdate_tmp_file_RSS]"));
 }
 
 TEST_F(VyxFeedTest, ItemsThatAreNotWantedAreSkipped) {
