@@ -102,8 +102,8 @@ TEST_F(UpdateUtilTest, DownloadedPatchTypeFromInfoFile) {
         UpdateUtil::PATCH_TYPE type = UpdateUtil::PATCH_TYPE_SMALL;
         UpdateUtil::CheckDownloadedPatchType(type);
         EXPECT_EQ(type, c.type);
-        const char* message = c.infoMessage ? c.infoMessage : "update_cpputil";
-        EXPECT_EQ(SyslogContains(message, LOG_INFO), c.infoMessage != nullptr);
+        EXPECT_EQ(SyslogContains(c.infoMessage ? c.infoMessage : "update_cpputil", LOG_INFO),
+                  c.infoMessage != nullptr);
     }
     EXPECT_FALSE(PathExists(info));  // the broken one was deleted
 }

@@ -45,9 +45,9 @@ TEST_F(VyxFeedTest, ItemsThatAreNotWantedAreSkipped) {
     for (const Case& c : cases) {
         SCOPED_TRACE(c.items);
         ASSERT_EQ(1, Parse(c.items, c.hotfixOnly));
-        EXPECT_EQ(c.found, found);
-        EXPECT_STREQ(c.build ? c.build : "", release.buildNum);
-        EXPECT_STREQ(c.build ? "http://h/img/mine.img" : "", release.link);
+        EXPECT_EQ(std::to_string(c.found) + " " +
+                      (c.build ? c.build + std::string(" http://h/img/mine.img") : " "),
+                  std::to_string(found) + " " + release.buildNum + " " + release.link);
     }
 }
 
