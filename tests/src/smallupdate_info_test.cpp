@@ -177,7 +177,6 @@ TEST_F(SmallUpdateInfoTest, PollerInAnotherProcessNeverSeesAHalfWrittenInfoFile)
 }
 
 TEST_F(SmallUpdateInfoTest, DownloadProgressAndFolders) {
-    // The package folder's place is the shared volume walk, seen in the download tests.
     Shell("mkdir -p /var/run/downloadVYX.status");  // a folder in the way: nothing written
     EXPECT_EQ(0, SmallUpdate::UpdateDownloadProgress(0, SmallUpdate::DOWNLOAD_STATUS_STOPPED));
     WriteFile("/tmp/d/a.deb", "x");

