@@ -28,12 +28,9 @@ if [ "${1:-}" != "--inside" ]; then
         exit 2
         ;;
     esac
-    BUILD="$SRC/build-bench"
-    cmake -S "$SRC" -B "$BUILD" -DCMAKE_BUILD_TYPE=Release -DKYTO_BUILD_BENCH=ON >/dev/null
-    cmake --build "$BUILD" -j2 --target kyto-sandbox status_poll_bench feed_bench \
-        feed_reader_check >/dev/null
-    exec "$BUILD/tests/kyto-sandbox" /bin/bash "$SRC/bench/reader_bench.sh" --inside \
-        "$BUILD" "$WHAT" "$@"
+    source "$SRC/bench/bench_lib.sh"
+    kyto_bench_enter_sandbox "$SRC/bench/reader_bench.sh" \
+        "status_poll_bench feed_bench feed_reader_check" "$WHAT" "$@"
 fi
 
 # ---- inside the sandbox ----------------------------------------------------------------

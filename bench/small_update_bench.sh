@@ -19,12 +19,8 @@ set -euo pipefail
 SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 
 if [ "${1:-}" != "--inside" ]; then
-    ROUNDS=${1:-6}
-    BUILD="$SRC/build-bench"
-    cmake -S "$SRC" -B "$BUILD" -DCMAKE_BUILD_TYPE=Release -DKYTO_BUILD_BENCH=ON >/dev/null
-    cmake --build "$BUILD" -j2 --target kyto-sandbox small_update_bench >/dev/null
-    exec "$BUILD/tests/kyto-sandbox" /bin/bash "$SRC/bench/small_update_bench.sh" --inside \
-        "$BUILD" "$ROUNDS"
+    source "$SRC/bench/bench_lib.sh"
+    kyto_bench_enter_sandbox "$SRC/bench/small_update_bench.sh" small_update_bench "${1:-6}"
 fi
 
 # ---- inside the sandbox ----------------------------------------------------------------
