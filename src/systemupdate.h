@@ -31,7 +31,9 @@ class KYTO_EXPORT SystemUpdate {
 
     SmallUpdate m_smallUpdate;
     VyxUpdate m_vyxUpdate;
-    UpdateUtil::PATCH_TYPE m_updateType;  // the kind found by the check, or PATCH_TYPE_NONE
+    // The kind found by the check, numbered as UpdateUtil::PATCH_TYPE (0 none, 1 full
+    // release, 2 small update); an int, as callers that keep or restore it expect.
+    int m_updateType;
     std::string m_fullVersion;
     bool m_blChecked;
 
