@@ -93,7 +93,9 @@ std::string SystemUpdate::GetFullVersion() {
 
 int SystemUpdate::ImportInfoFile() {
     Json::Value root;
-    if (!UpdateUtil::ParseJsonRootFromFile(kyto::kAutoUpdateInfoFile, root))
+    // A document that is not an object (an array, a bare word or number) is no record; a
+    // member lookup on it would throw inside jsoncpp.
+    if (!UpdateUtil::ParseJsonRootFromFile(kyto::kAutoUpdateInfoFile, root) || !root.isObject())
         return 0;
     // The type words are compared by the identity of their storage, not by their text, so
     // a word read from the file never matches: a fresh object does not apply an update

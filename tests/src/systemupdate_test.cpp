@@ -175,6 +175,16 @@ TEST_F(SystemUpdateTest, CancelReadsTheRunningKindFromTheStatusFile) {
     }
 }
 
+// An info file that is JSON but not a record is a file the facade cannot use: 0, no throw.
+TEST_F(SystemUpdateTest, InfoFileWhoseRootIsNotAnObjectIsRefused) {
+    for (const char* root : {"[]", "\"x\"", "7", "true", "[{\"updateType\":1}]"}) {
+        SCOPED_TRACE(root);
+        WriteFile(kInfo, root);
+        EXPECT_NO_THROW(EXPECT_EQ(0, SystemUpdate().ImportInfoFile()));
+        EXPECT_NO_THROW(EXPECT_EQ(0, SystemUpdate().Apply()));
+    }
+}
+
 // The appliance's road for a small fix: check, download in one process while another polls,
 // services stopped, apply in a fresh process, services started.
 TEST_F(SystemUpdateTest, SmallFixEndToEnd) {
