@@ -30,8 +30,9 @@ bool MemberStringList(const Json::Value& object, const char* key, std::vector<st
 // Writes root in the compact one-line form to a temporary file next to path and renames
 // it over path, so that a poller never reads (and then deletes as broken) a half-written
 // document.  Results as UpdateUtil::DumpJsonRootToFile: 1 written (a short write counts,
-// a failed flush is logged and leaves the old file), 0 when the file cannot be made or
-// nothing is written; with logFailures its messages are logged under path.
+// a failed flush is logged), 0 when the file cannot be made or nothing is written; with
+// logFailures its messages are logged under path.  A write or flush that fails removes the
+// old file at path, as a failed rewrite in place would have broken it.
 int DumpJsonAtomically(const char* path, const Json::Value& root, bool logFailures);
 
 }  // namespace kyto

@@ -130,9 +130,13 @@ int kyto::DumpJsonAtomically(const char* path, const Json::Value& root, bool log
     fchmod(fileno(file.get()), 0644);
     bool flushFailed = false;
     const int ret = WriteJsonText(file, text, path, logFailures, &flushFailed);
-    // Only a complete document replaces the old one.
-    if (ret != 1 || flushFailed)
+    // Only a complete document replaces the old one; after a failed write no earlier
+    // record stays at the target either, as after a failed rewrite in place (whose broken
+    // file the next reader deletes): a reader must never take the old record for the new.
+    if (ret != 1 || flushFailed) {
+        unlink(path);
         return ret;
+    }
     if (rename(tmpPath.c_str(), path) != 0) {
         // Where the rename is refused (a folder in the way) opening the path in place
         // would have failed too.

@@ -152,6 +152,20 @@ TEST_F(SmallUpdateInfoTest, DumpFailuresLeaveNoInfoFiles) {
     }
 }
 
+// A record that cannot be written whole on a full volume must not leave the earlier one in
+// its place: a poller or a later apply would take the old update for the new one.
+TEST_F(SmallUpdateInfoTest, FullVolumeLeavesNoEarlierRecord) {
+    MountVolume("/volume2", 16 << 10);
+    SmallUpdate u = DumpableRecord();
+    u.m_debDir = "/volume2";
+    ASSERT_TRUE(u.DumpToInfoFile(true));
+    ASSERT_TRUE(PathExists("/volume2/autoupd@te.info"));
+    ASSERT_EQ(0, Shell("dd if=/dev/zero of=/volume2/filler bs=4096 2>/dev/null; true"));
+    u.m_newSmallFixNumber = 9;
+    u.DumpToInfoFile(true);
+    EXPECT_FALSE(PathExists("/volume2/autoupd@te.info"));
+}
+
 // The interface's poller reads the info file while a download rewrites it: it must always
 // find a whole record (a broken one would be deleted by the reader).
 TEST_F(SmallUpdateInfoTest, PollerInAnotherProcessNeverSeesAHalfWrittenInfoFile) {
