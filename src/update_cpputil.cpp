@@ -219,9 +219,7 @@ int UpdateUtil::CleanFolder(const char* path) {
     if (!RemoveFolder(path))
         return 0;
     if (mkdir(path, 0755) != 0) {
-        // mkdir is a C library call: record it as the platform's last error so the message
-        // names this failure and not an older one.
-        KLIBCErrSetEx(KYTO_ERR_SYSTEM, __FILE__, __LINE__);
+        // The platform's last error as it stood: callers read it with KLIBCErrGet.
         syslog(LOG_ERR, "%s:%d Fail to mkdir: %s, KytoErr =%s", kModule, __LINE__, path,
                kyto::LastErrorText().c_str());
         return 0;

@@ -5,6 +5,8 @@
 
 #include <climits>
 
+#include <kytoplatform/klibc.h>
+
 #include "sandbox.h"
 #include "update_cpputil.h"
 
@@ -56,8 +58,13 @@ TEST_F(UpdateUtilTest, UntarKeepsPermissionsAndFoldersAreCleaned) {
     // Cleaning and removing folders that exist: the package folders of the download tests.
     EXPECT_EQ(UpdateUtil::CleanFolder("/tmp/fresh"), 1);  // a missing folder is created
     EXPECT_TRUE(IsDirectory("/tmp/fresh"));
-    EXPECT_EQ(UpdateUtil::CleanFolder("/tmp/noparent/sub"), 0);  // parents are not made
-    EXPECT_TRUE(SyslogContains(" Fail to mkdir: /tmp/noparent/sub, KytoErr =[0x0D", LOG_ERR));
+    // Parents are not made; the message and the caller see the platform's last error as it
+    // stood, not one the helper made up.
+    KLIBCErrSetEx(0x0D07, "earlier.c", 42);
+    EXPECT_EQ(UpdateUtil::CleanFolder("/tmp/noparent/sub"), 0);
+    EXPECT_TRUE(SyslogContains(" Fail to mkdir: /tmp/noparent/sub, KytoErr =[0x0D07 earlier.c:42]",
+                               LOG_ERR));
+    EXPECT_EQ(0x0D07, KLIBCErrGet());
 }
 
 TEST_F(UpdateUtilTest, FirstWritableDataVolumeWithEnoughRoomWinsElseRoot) {
