@@ -197,7 +197,7 @@ void SmallUpdate::GetDownloadStatus(int& percentage, std::string& status) {
 }
 
 bool SmallUpdate::CancelDownload() {
-    kyto::UniqueFd marker(open(kStopMarker, O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+    kyto::UniqueFd marker(open(kStopMarker, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
     if (!marker.valid() && !StopRequested()) {
         syslog(LOG_ERR, "%s:%d failed to create stop status file%s", kModule, __LINE__,
                kyto::LastErrorText().c_str());

@@ -139,6 +139,10 @@ TEST_F(SmallUpdateDownloadTest, StopMarkerBeforeBetweenAndAfterFiles) {
         EXPECT_EQ(when == kBetween ? 0u : 3u, ListDir(kDir).size());
         Shell("rm -f /tmp/stop_download_smallfix /autoupd@te.info");
     }
+    // The marker is an empty file, also where an old one had content.
+    WriteFile(kMarker, "left by something else");
+    EXPECT_TRUE(SmallUpdate().CancelDownload());
+    EXPECT_EQ("", ReadFile(kMarker).value_or("missing"));
 }
 
 TEST_F(SmallUpdateDownloadTest, WhatIsFetchedAndWhatCountsAsDownloaded) {
