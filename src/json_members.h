@@ -11,6 +11,8 @@
 
 #include <json/json.h>
 
+#include "scoped.h"
+
 namespace kyto {
 
 // Parses text into root (comments not collected).  False when the text is not JSON or the
@@ -26,6 +28,12 @@ bool MemberBool(const Json::Value& object, const char* key);
 // A member holding an array of strings; a missing member is an empty list.  False (with
 // out emptied) when the member is something else or holds a non-string.
 bool MemberStringList(const Json::Value& object, const char* key, std::vector<std::string>& out);
+
+// Writes text to the open file, logging under reportedPath when logFailures is set.  A
+// short but non-zero write counts as written.  1 written, 0 not; *flushFailed tells that
+// the data did not reach the file when it was closed (the result stays as it is).
+int WriteJsonText(UniqueFile& file, const std::string& text, const char* reportedPath,
+                  bool logFailures, bool* flushFailed);
 
 // Writes root in the compact one-line form to a temporary file next to path and renames
 // it over path, so that a poller never reads (and then deletes as broken) a half-written

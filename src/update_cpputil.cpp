@@ -68,27 +68,6 @@ int UpdateUtil::ParseJsonRootFromFile(const char* path, Json::Value& root) {
     return 1;
 }
 
-namespace {
-
-// Writes text to the open file, logging under reportedPath when logFailures is set.  A
-// short but non-zero write counts as written.  1 written, 0 not; *flushFailed tells
-// that the data did not reach the file when it was closed (the result stays as it is).
-int WriteJsonText(kyto::UniqueFile& file, const std::string& text, const char* reportedPath,
-                  bool logFailures, bool* flushFailed) {
-    int ret = 1;
-    if (fwrite(text.data(), 1, text.size(), file.get()) == 0) {
-        if (logFailures)
-            syslog(LOG_ERR, "%s:%d Failed to write to %s", kModule, __LINE__, reportedPath);
-        ret = 0;
-    }
-    *flushFailed = file.close() != 0;
-    if (*flushFailed && ret == 1 && logFailures)
-        syslog(LOG_ERR, "%s:%d Failed to write to %s", kModule, __LINE__, reportedPath);
-    return ret;
-}
-
-}  // namespace
-
 int UpdateUtil::DumpJsonRootToFile(const char* path, const Json::Value& root) {
     if (!path) {
         KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, __FILE__, __LINE__);
@@ -106,46 +85,7 @@ int UpdateUtil::DumpJsonRootToFile(const char* path, const Json::Value& root) {
         return 0;
     }
     bool flushFailed = false;
-    return WriteJsonText(file, text, path, true, &flushFailed);
-}
-
-int kyto::DumpJsonAtomically(const char* path, const Json::Value& root, bool logFailures) {
-    Json::FastWriter writer;
-    const std::string text = writer.write(root);
-
-    std::string tmpPath = std::string(path) + ".XXXXXX";
-    kyto::UniqueFd fd(mkostemp(&tmpPath[0], O_CLOEXEC));
-    kyto::UniqueFile file(fd.valid() ? fdopen(fd.get(), "w") : nullptr);
-    if (!file) {
-        if (fd.valid())
-            unlink(tmpPath.c_str());
-        if (logFailures)
-            syslog(LOG_ERR, "%s:%d Failed to open %s", kModule, __LINE__, path);
-        return 0;
-    }
-    fd.release();  // now owned by file
-    kyto::ScopedUnlink removeTmp(tmpPath);
-    // Readers in other processes and users (the interface, the installer): the mode of a
-    // file created in place.
-    fchmod(fileno(file.get()), 0644);
-    bool flushFailed = false;
-    const int ret = WriteJsonText(file, text, path, logFailures, &flushFailed);
-    // Only a complete document replaces the old one; after a failed write no earlier
-    // record stays at the target either, as after a failed rewrite in place (whose broken
-    // file the next reader deletes): a reader must never take the old record for the new.
-    if (ret != 1 || flushFailed) {
-        unlink(path);
-        return ret;
-    }
-    if (rename(tmpPath.c_str(), path) != 0) {
-        // Where the rename is refused (a folder in the way) opening the path in place
-        // would have failed too.
-        if (logFailures)
-            syslog(LOG_ERR, "%s:%d Failed to open %s", kModule, __LINE__, path);
-        return 0;
-    }
-    removeTmp.release();
-    return 1;
+    return kyto::WriteJsonText(file, text, path, true, &flushFailed);
 }
 
 int UpdateUtil::JsonArray2StringVector(const Json::Value& array, std::vector<std::string>& out) {
