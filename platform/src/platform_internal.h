@@ -14,7 +14,7 @@
 #include <kytoplatform/klibc.h>
 #include <kytoplatform/kyto_errors.h>
 
-#include "scoped_owners.h"
+#include "scoped.h"
 
 // Records code as the thread's last error, with the file and line of the failure site.
 #define KYTO_FAIL(code) KLIBCErrSetEx((code), __FILE__, __LINE__)

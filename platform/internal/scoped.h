@@ -1,19 +1,25 @@
-// RAII owners for C resources, shared by the platform layer and the library (which
-// includes this header through src/scoped.h), so that no early return leaks a descriptor,
-// a FILE*, a pipe or a temporary file, and no child is left unreaped.  Header only and
-// free of any platform or library call: the platform layer must not depend on the
-// library.  Internal: not installed.
-#ifndef KYTO_SCOPED_OWNERS_H
-#define KYTO_SCOPED_OWNERS_H
+// RAII owners for C resources, shared by the platform layer, the library and the programs
+// built in this tree, so that no early return leaks a descriptor, a FILE*, a pipe, a
+// temporary file or a platform allocation, and no child is left unreaped.  Header only;
+// it uses nothing but the C library and the platform's public calls (the platform layer
+// must not depend on the library).  Internal: found through the build tree's include path,
+// never installed.
+#ifndef KYTO_SCOPED_H
+#define KYTO_SCOPED_H
 
 #include <errno.h>
 #include <stdio.h>
 #include <sys/types.h>
 #include <sys/wait.h>
+#include <stdlib.h>
 #include <unistd.h>
 
+#include <memory>
 #include <string>
 #include <utility>
+
+#include <kytoplatform/klibc.h>
+#include <kytoplatform/kyto_system.h>
 
 // Each shared object keeps its own copy; none of these is part of an exported interface.
 #pragma GCC visibility push(hidden)
@@ -107,6 +113,29 @@ inline ssize_t ReadRetry(int fd, void* buf, size_t size) {
     } while (n < 0 && errno == EINTR);
     return n;
 }
+
+struct SzListFree {
+    void operator()(PKLIBC_SZLIST list) const { KLIBCSzListFree(list); }
+};
+// Owns a platform string list.
+using UniqueSzList = std::unique_ptr<KLIBC_SZLIST, SzListFree>;
+
+struct MountVolListFree {
+    void operator()(PKYTO_MOUNT_VOL_INFO list) const { KYTOMountVolInfoFree(list); }
+};
+// Owns the platform's list of mounted volumes.
+using UniqueMountVolList = std::unique_ptr<KYTO_MOUNT_VOL_INFO, MountVolListFree>;
+
+// A getline buffer that is freed on every way out.
+struct LineBuffer {
+    char* data = nullptr;
+    size_t size = 0;
+    LineBuffer() = default;
+    LineBuffer(const LineBuffer&) = delete;
+    LineBuffer& operator=(const LineBuffer&) = delete;
+    ~LineBuffer() { free(data); }
+    ssize_t Read(FILE* f) { return getline(&data, &size, f); }
+};
 
 }  // namespace kyto
 #pragma GCC visibility pop
