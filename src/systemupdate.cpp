@@ -30,7 +30,7 @@ void SystemUpdate::TidyDownloadStatus() {
         vyxStatus > VyxUpdate::VYX_DOWNLOAD_STATUS_FINISHED)
         unlink(kyto::kDownloadStatusFile);
 
-    // The small-update reader needs a "percentage" key, which a full-release download never
+    // KEPT: the small-update reader needs a "percentage" key, which a full-release download never
     // writes: such a file reads as failed here and goes as well, on purpose, unless a
     // finished download's info file answers "finished".
     std::string word;
@@ -97,13 +97,12 @@ int SystemUpdate::ImportInfoFile() {
     // member lookup on it would throw inside jsoncpp.
     if (!UpdateUtil::ParseJsonRootFromFile(kyto::kAutoUpdateInfoFile, root) || !root.isObject())
         return 0;
-    // The type words are compared by the identity of their storage, not by their text, so
+    // KEPT: the type words are compared by the identity of their storage, not by their text, so
     // a word read from the file never matches: a fresh object does not apply an update
     // found in the info file.  Callers that want the downloaded kind read it with
     // UpdateUtil::CheckDownloadedPatchType, which compares the text.
-    const char* type = root[kyto::kKeyUpdateType].isString()
-                           ? root[kyto::kKeyUpdateType].asCString()
-                           : nullptr;
+    const char* type =
+        root[kyto::kKeyUpdateType].isString() ? root[kyto::kKeyUpdateType].asCString() : nullptr;
     if (type == kyto::kTypeVyx) {
         m_updateType = UpdateUtil::PATCH_TYPE_VYX;
         return 1;

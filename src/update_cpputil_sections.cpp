@@ -11,7 +11,7 @@ struct ServiceSection {
     const char* key;
 };
 
-// Several scripts share one name on purpose (the two network scripts, the three media
+// KEPT: several scripts share one name on purpose (the two network scripts, the three media
 // indexing daemons, the two network backup daemons).  The message bus is known but has no
 // name to show.
 const ServiceSection kServiceSections[] = {
