@@ -16,6 +16,7 @@
 #include "child_process.h"
 #include "kyto_paths.h"
 #include "scoped.h"
+#include "version_file.h"
 
 namespace {
 
@@ -90,15 +91,14 @@ int DebianLib::FindSmallFixNumfromDeb(const std::string& debName) {
 
     // An absent or empty build number cannot match any package, so it counts as a
     // failure to read it, like an unreadable file.
-    char buildNumber[32] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buildNumber, sizeof(buildNumber),
-                             0) <= 0) {
+    const kyto::VersionKey<32> build("buildnumber");
+    if (build.result <= 0) {
         syslog(LOG_ERR, "%s:%d Get buildnumber Fail\n", kModule, __LINE__);
         return -1;
     }
-    if (debName.find(std::string("-") + buildNumber + "-s") == std::string::npos) {
+    if (debName.find(std::string("-") + build.text + "-s") == std::string::npos) {
         syslog(LOG_ERR, "%s:%d different buildnumber of deb [%s] with system buildnumber [%s]\n",
-               kModule, __LINE__, debName.c_str(), buildNumber);
+               kModule, __LINE__, debName.c_str(), build.text);
         return -1;
     }
 

@@ -21,6 +21,7 @@
 #include "kyto_paths.h"
 #include "platform_error.h"
 #include "scoped.h"
+#include "version_file.h"
 
 namespace {
 
@@ -237,35 +238,35 @@ void UpdateUtil::CheckDownloadedPatchType(PATCH_TYPE& type) {
         (kind.isString() && kind.asString() == kyto::kTypeVyx) ? PATCH_TYPE_VYX : PATCH_TYPE_SMALL;
 }
 
+namespace {
+
+// True when the key=value reader's answer for key is no error; logs the error otherwise.
+bool KeyReadable(const char* key, int result) {
+    if (result >= 0)
+        return true;
+    syslog(LOG_ERR, "%s:%d Get %s Fail%s", kModule, __LINE__, key, kyto::LastErrorText().c_str());
+    return false;
+}
+
+}  // namespace
+
 int UpdateUtil::GetUserAgent(std::string& agent) {
     char szUnique[128] = {0};
-    char szBuild[64] = {0};
-    char szMajor[16] = {0};
-    char szMinor[16] = {0};
-
-    if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "unique", szUnique, sizeof(szUnique), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get unique Fail%s", kModule, __LINE__,
-               kyto::LastErrorText().c_str());
+    if (!KeyReadable("unique", KLIBCFileGetKeyValue(kyto::kInfoConfFile, "unique", szUnique,
+                                                    sizeof(szUnique), 0)))
         return 0;
-    }
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", szBuild, sizeof(szBuild), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
-               kyto::LastErrorText().c_str());
+    const kyto::VersionKey<64> build("buildnumber");
+    if (!KeyReadable("buildnumber", build.result))
         return 0;
-    }
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "majorversion", szMajor, sizeof(szMajor), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get majorversion Fail%s", kModule, __LINE__,
-               kyto::LastErrorText().c_str());
+    const kyto::VersionKey<16> major("majorversion");
+    if (!KeyReadable("majorversion", major.result))
         return 0;
-    }
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "minorversion", szMinor, sizeof(szMinor), 0) < 0) {
-        syslog(LOG_ERR, "%s:%d Get minorversion Fail%s", kModule, __LINE__,
-               kyto::LastErrorText().c_str());
+    const kyto::VersionKey<16> minor("minorversion");
+    if (!KeyReadable("minorversion", minor.result))
         return 0;
-    }
     char szAgent[512] = {0};
-    snprintf(szAgent, sizeof(szAgent), "%s VYX%s.%s %s (autoupgrade)", szUnique, szMajor, szMinor,
-             szBuild);
+    snprintf(szAgent, sizeof(szAgent), "%s VYX%s.%s %s (autoupgrade)", szUnique, major.text,
+             minor.text, build.text);
     agent = szAgent;
     return 1;
 }
