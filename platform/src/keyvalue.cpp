@@ -284,11 +284,104 @@ int KvGet(const char* path, const std::string& key, std::string* value) {
                     [value](const char* v, size_t n) { value->assign(v, n); });
 }
 
+namespace {
+
+// ---- Steps of KLIBCFileSetKeyValue ----
+
+bool ValidSetArguments(const char* path, const char* key, const char* value,
+                       const char* lineFormat) {
+    return path != nullptr && *path != '\0' && key != nullptr && *key != '\0' && value != nullptr &&
+           key[0] != '#' && !IsBlank(key[0]) && !IsBlank(key[strlen(key) - 1]) &&
+           strpbrk(key, "=\n") == nullptr && strchr(value, '\n') == nullptr &&
+           ValidLineFormat(lineFormat);
+}
+
+// The file's lines and mode; a missing file is an empty one, created with 0644.  False
+// (the platform error set) when it exists but cannot be read.
+bool LoadForRewrite(const char* path, std::vector<std::string>* lines, bool* endsWithNewline,
+                    mode_t* mode) {
+    ErrorKeeper keeper;
+    if (KvLoad(path, lines, endsWithNewline) != 0) {
+        if (KLIBCErrGet() != KYTO_ERR_FILE_NOT_FOUND) {
+            keeper.dismiss();
+            return false;
+        }
+        lines->clear();  // no file yet: it is created
+        return true;
+    }
+    struct stat st;
+    if (::stat(path, &st) == 0)
+        *mode = st.st_mode & 07777;
+    return true;
+}
+
+// The line lineFormat makes of key and value.  Every line ends with a newline, even when
+// the format forgot it, so that the next line is not glued to this one.
+bool FormatLine(const char* lineFormat, const char* key, const char* value, std::string* out) {
+    int len = snprintf(nullptr, 0, lineFormat, key, value);
+    if (len < 0)
+        return false;
+    std::string line(static_cast<size_t>(len) + 1, '\0');
+    snprintf(&line[0], line.size(), lineFormat, key, value);
+    line.resize(static_cast<size_t>(len));
+    if (line.empty() || line.back() != '\n')
+        line.push_back('\n');
+    *out = std::move(line);
+    return true;
+}
+
+// The new content: the first line of key replaced by newLine, or newLine appended.
+std::string ReplaceOrAppend(const std::vector<std::string>& lines, bool endsWithNewline,
+                            const std::string& key, const std::string& newLine) {
+    std::string content;
+    bool replaced = false;
+    for (size_t i = 0; i < lines.size(); ++i) {
+        if (!replaced && KvLineMatches(lines[i], key, nullptr)) {
+            content += newLine;
+            replaced = true;
+            continue;
+        }
+        content += lines[i];
+        if (i + 1 < lines.size() || endsWithNewline)
+            content.push_back('\n');
+    }
+    if (!replaced) {
+        if (!content.empty() && content.back() != '\n')
+            content.push_back('\n');
+        content += newLine;
+    }
+    return content;
+}
+
+// Writes content to a temporary file beside path (synced, with mode) and renames it over
+// path.  False, with the platform error set, when any step fails.
+bool ReplaceFile(const char* path, const std::string& content, mode_t mode) {
+    std::string dir, base;
+    SplitPath(path, &dir, &base);
+    std::string tmpl = dir + "/." + base + ".XXXXXX";
+    UniqueFd fd(::mkostemp(&tmpl[0], O_CLOEXEC));
+    if (!fd.valid()) {
+        KYTO_FAIL(OpenErrorCode(errno, KYTO_ERR_FILE_WRITE));
+        return false;
+    }
+    ScopedUnlink cleanup(tmpl);
+    if (::fchmod(fd.get(), mode) != 0 || !WriteAll(fd.get(), content) || ::fsync(fd.get()) != 0 ||
+        ::close(fd.release()) != 0 || ::rename(tmpl.c_str(), path) != 0) {
+        KYTO_FAIL(KYTO_ERR_FILE_WRITE);
+        return false;
+    }
+    cleanup.release();
+    return true;
+}
+
+}  // namespace
+
 }  // namespace kytoplat
 
 extern "C" {
 
-int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags) noexcept try {
+int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags) noexcept
+    try {
     if (path == nullptr || *path == '\0' || key == nullptr || *key == '\0' || buf == nullptr ||
         size < 1 || flags != 0) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
@@ -318,86 +411,22 @@ int KLIBCFileSetKeyValue(const char* path, const char* key, const char* value,
                          const char* lineFormat) noexcept try {
     if (lineFormat == nullptr)
         lineFormat = kDefaultLineFormat;
-    if (path == nullptr || *path == '\0' || key == nullptr || *key == '\0' || value == nullptr ||
-        key[0] == '#' || IsBlank(key[0]) || IsBlank(key[strlen(key) - 1]) ||
-        strpbrk(key, "=\n") != nullptr || strchr(value, '\n') != nullptr ||
-        !ValidLineFormat(lineFormat)) {
+    if (!kytoplat::ValidSetArguments(path, key, value, lineFormat)) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
-
     std::vector<std::string> lines;
     bool endsWithNewline = true;
     mode_t mode = 0644;
-    {
-        kytoplat::ErrorKeeper keeper;
-        if (kytoplat::KvLoad(path, &lines, &endsWithNewline) != 0) {
-            if (KLIBCErrGet() != KYTO_ERR_FILE_NOT_FOUND) {
-                keeper.dismiss();
-                return -1;
-            }
-            lines.clear();  // no file yet: it is created
-        } else {
-            struct stat st;
-            if (::stat(path, &st) == 0)
-                mode = st.st_mode & 07777;
-        }
-    }
-
-    int len = snprintf(nullptr, 0, lineFormat, key, value);
-    if (len < 0) {
+    if (!kytoplat::LoadForRewrite(path, &lines, &endsWithNewline, &mode))
+        return -1;
+    std::string newLine;
+    if (!kytoplat::FormatLine(lineFormat, key, value, &newLine)) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;
     }
-    std::string newLine(static_cast<size_t>(len) + 1, '\0');
-    snprintf(&newLine[0], newLine.size(), lineFormat, key, value);
-    newLine.resize(static_cast<size_t>(len));
-    // Every line ends with a newline, even when the format forgot it, so that the next
-    // line is not glued to this one.
-    if (newLine.empty() || newLine.back() != '\n')
-        newLine.push_back('\n');
-
-    std::string content;
-    bool replaced = false;
-    for (size_t i = 0; i < lines.size(); ++i) {
-        if (!replaced && kytoplat::KvLineMatches(lines[i], key, nullptr)) {
-            content += newLine;
-            replaced = true;
-            continue;
-        }
-        content += lines[i];
-        if (i + 1 < lines.size() || endsWithNewline)
-            content.push_back('\n');
-    }
-    if (!replaced) {
-        if (!content.empty() && content.back() != '\n')
-            content.push_back('\n');
-        content += newLine;
-    }
-
-    std::string dir, base;
-    SplitPath(path, &dir, &base);
-    std::string tmpl = dir + "/." + base + ".XXXXXX";
-    kytoplat::UniqueFd fd(::mkostemp(&tmpl[0], O_CLOEXEC));
-    if (!fd.valid()) {
-        KYTO_FAIL(kytoplat::OpenErrorCode(errno, KYTO_ERR_FILE_WRITE));
-        return -1;
-    }
-    kytoplat::ScopedUnlink cleanup(tmpl);
-    if (::fchmod(fd.get(), mode) != 0 || !WriteAll(fd.get(), content) || ::fsync(fd.get()) != 0) {
-        KYTO_FAIL(KYTO_ERR_FILE_WRITE);
-        return -1;
-    }
-    if (::close(fd.release()) != 0) {
-        KYTO_FAIL(KYTO_ERR_FILE_WRITE);
-        return -1;
-    }
-    if (::rename(tmpl.c_str(), path) != 0) {
-        KYTO_FAIL(KYTO_ERR_FILE_WRITE);
-        return -1;
-    }
-    cleanup.release();
-    return 1;
+    const std::string content = kytoplat::ReplaceOrAppend(lines, endsWithNewline, key, newLine);
+    return kytoplat::ReplaceFile(path, content, mode) ? 1 : -1;
 } catch (...) {
     return KYTO_FAIL_ON_EXCEPTION(-1);
 }
