@@ -10,6 +10,7 @@
 #include "kytoupdate_common.h"
 #include "smallupdate_plan.h"
 #include "update_cpputil.h"
+#include "vyxupdate.h"
 
 namespace kytoupdate {
 
@@ -102,20 +103,27 @@ void PrintPlan(const Json::Value& plan, const SmallUpdate& u, int restart, bool 
         printf("  package %s\n", p.asCString());
 }
 
+// Why u holds no fix after its lookup: an exit code, and "none" when there is no fix.
+int NoFix(SmallUpdate& u, bool json) {
+    const int code = u.GetErrno();
+    // An unreachable patch-list server leaves no error code, as a missing list does: only
+    // a release feed that answers, as check asks it, tells that nothing is on offer.
+    bool haveRelease = false;
+    if (code == SmallUpdate::ERROR_CODE_SERVER_STATUS ||
+        (code == SmallUpdate::ERROR_CODE_NONE && VyxUpdate().CheckNewRelease(haveRelease) != 1))
+        return Fail("could not ask the update server", kExitCannotCheck);
+    if (code != SmallUpdate::ERROR_CODE_NONE)
+        return Fail(SmallErrnoText(code));
+    printf(json ? "{}\n" : "none\n");
+    return kExitUpToDate;
+}
+
 }  // namespace
 
 int CmdPlan(bool json) {
     SmallUpdate u;
-    if (!u.HaveNewFix()) {
-        const int code = u.GetErrno();
-        if (code == SmallUpdate::ERROR_CODE_SERVER_STATUS)
-            return Fail("could not ask the update server", kExitCannotCheck);
-        if (code == SmallUpdate::ERROR_CODE_NONE) {
-            printf(json ? "{}\n" : "none\n");
-            return kExitUpToDate;
-        }
-        return Fail(SmallErrnoText(code));
-    }
+    if (!u.HaveNewFix())
+        return NoFix(u, json);
     const int restart = u.GetServiceRestartType();
     bool listReadable = true;
     const Json::Value plan = PlanDocument(u, restart, RestartScripts(u, restart, listReadable));

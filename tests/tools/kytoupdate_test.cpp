@@ -130,8 +130,9 @@ TEST_F(KytoupdateTest, CheckTellsKindVersionOrWhyNot) {
     r = Cmd("check");  // a full release wins over the small update
     EXPECT_EQ(0, r.rc) << r.err;
     EXPECT_EQ("vyx VYX 5.2-5700\n", r.out);
-    SetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server", "http://127.0.0.1:1/x");
-    for (const char* cmd : {"check", "download", "auto"}) {
+    for (const char* key : {"rss_server", "small_info_path"})  // the server is unreachable
+        SetKeyValue("/etc.defaults/kytoinfo.conf", key, "http://127.0.0.1:1/x");
+    for (const char* cmd : {"check", "download", "auto", "plan"}) {
         r = Cmd(cmd);
         EXPECT_EQ(2, r.rc) << cmd;
         EXPECT_EQ("", r.out);
