@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <vector>
 
 #include <CLI/CLI.hpp>
 
@@ -70,6 +71,17 @@ int Run(const std::string& cmd, const Options& o) {
     return CmdAuto();
 }
 
+// The exit code of a parse that stopped (--help and --version stop it too).  A first word
+// that names no command is left over, and CLI11 would only say that a command is missing.
+int ParseFailed(const CLI::App& app, const CLI::ParseError& e) {
+    const std::vector<std::string> left = app.remaining();
+    if (dynamic_cast<const CLI::RequiredError*>(&e) && app.get_subcommands().empty() &&
+        !left.empty() && left.front().compare(0, 1, "-") != 0)
+        return Fail("unknown command '" + left.front() + "' (kytoupdate --help lists them)",
+                    kExitUsage);
+    return app.exit(e) == 0 ? kExitOk : kExitUsage;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -84,8 +96,7 @@ int main(int argc, char** argv) {
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {
-        const int rc = app.exit(e);
-        return rc == 0 ? kExitOk : kExitUsage;
+        return ParseFailed(app, e);
     }
 
     // The library runs some programs by relative names that it expects to resolve from the

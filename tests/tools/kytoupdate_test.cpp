@@ -95,14 +95,22 @@ class KytoupdateTest : public SandboxTest {
     std::unique_ptr<UpdateServer> server;
 };
 
-TEST_F(KytoupdateTest, BadArgumentsAndHelp) {
-    for (const char* bad : {"", "bogus", "services", "services restart", "import",
-                            "import /nonexistent.tar", "status --interval 0", "check --json"}) {
-        SCOPED_TRACE(bad);
-        const Result r = Cmd(bad);
+TEST_F(KytoupdateTest, BadArgumentsAreNamedAndHelp) {
+    const std::pair<const char*, const char*> bad[] = {  // arguments, what the error names
+        {"", "A subcommand is required"},
+        {"bogus", "kytoupdate: unknown command 'bogus'"},
+        {"services", "ACTION is required"},
+        {"services restart", "restart not in {stop,start}"},
+        {"import", "ARCHIVE is required"},
+        {"import /nonexistent.tar", "File does not exist: /nonexistent.tar"},
+        {"status --interval 0", "--interval: Value 0 not in range"},
+        {"check --json", "not expected: --json"}};
+    for (const auto& [args, error] : bad) {
+        SCOPED_TRACE(args);
+        const Result r = Cmd(args);
         EXPECT_EQ(64, r.rc);
         EXPECT_EQ("", r.out);
-        EXPECT_NE("", r.err);
+        EXPECT_NE(std::string::npos, r.err.find(error)) << r.err;
     }
     for (const char* cmd : {"", "check", "download", "status", "cancel", "apply", "services",
                             "import", "plan", "auto"}) {
