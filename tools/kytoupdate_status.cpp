@@ -1,20 +1,19 @@
 #include "kytoupdate_status.h"
 
+#include <stdio.h>
 #include <stdlib.h>
 
 #include <sstream>
 
 #include <kytoplatform/klibc.h>
 
+#include "kyto_paths.h"
+#include "kytoupdate_common.h"
 #include "smallupdate.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
 
 namespace kytoupdate {
-
-namespace {
-const char* const kDownloadStatusFile = "/var/run/downloadVYX.status";
-}
 
 bool StatusSnapshot::operator==(const StatusSnapshot& o) const {
     return downloading == o.downloading && vyxReadable == o.vyxReadable &&
@@ -27,23 +26,23 @@ bool StatusSnapshot::operator==(const StatusSnapshot& o) const {
 
 std::string DownloadStatusKey(const char* key) {
     char buf[4096] = {0};
-    if (KLIBCFileGetKeyValue(kDownloadStatusFile, key, buf, sizeof(buf), 0) <= 0)
+    if (KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, key, buf, sizeof(buf), 0) <= 0)
         return "";
     return buf;
 }
 
 StatusSnapshot TakeSnapshot() {
     StatusSnapshot s;
-    s.downloading = DownloadStatusKey("updateType");
+    s.downloading = DownloadStatusKey(kyto::kKeyUpdateType);
 
     VyxUpdate::VYX_DOWNLOAD_STATUS vyx = VyxUpdate::VYX_DOWNLOAD_STATUS_NONE;
     s.vyxReadable = VyxUpdate::GetDownloadStatus(s.vyxPercentage, vyx);
     s.vyxStatus = s.vyxReadable ? VyxUpdate::DownloadStatusToString(vyx) : "unknown";
-    if (s.downloading == "vyxupdate") {
+    if (s.downloading == kyto::kTypeVyx) {
         // Image n of m and its path, as the full-release download writes them.
-        s.images = atoi(DownloadStatusKey("downloadCount").c_str());
-        s.image = atoi(DownloadStatusKey("downloadNum").c_str());
-        s.imagePath = DownloadStatusKey("patchPath");
+        s.images = atoi(DownloadStatusKey(kyto::kKeyDownloadCount).c_str());
+        s.image = atoi(DownloadStatusKey(kyto::kKeyDownloadNum).c_str());
+        s.imagePath = DownloadStatusKey(kyto::kKeyPatchPath);
     }
 
     // The reader is a member; a scratch engine keeps the record it loads to itself.
@@ -54,8 +53,8 @@ StatusSnapshot TakeSnapshot() {
 
     UpdateUtil::PATCH_TYPE type = UpdateUtil::PATCH_TYPE_NONE;
     UpdateUtil::CheckDownloadedPatchType(type);
-    s.downloaded = type == UpdateUtil::PATCH_TYPE_VYX     ? "vyxupdate"
-                   : type == UpdateUtil::PATCH_TYPE_SMALL ? "smallupdate"
+    s.downloaded = type == UpdateUtil::PATCH_TYPE_VYX     ? kyto::kTypeVyx
+                   : type == UpdateUtil::PATCH_TYPE_SMALL ? kyto::kTypeSmall
                                                           : "";
     return s;
 }
@@ -101,6 +100,28 @@ std::string ToText(const StatusSnapshot& s) {
         out << " (error: " << s.applyError << ")";
     out << "\n";
     return out.str();
+}
+
+int CmdStatus(bool json, bool watch, double interval) {
+    if (watch)
+        CatchStopSignals();
+    StatusSnapshot last;
+    bool first = true;
+    do {
+        const StatusSnapshot now = TakeSnapshot();
+        if (first || now != last) {
+            if (json)
+                printf("%s", Json::FastWriter().write(ToJson(now)).c_str());
+            else
+                printf("%s%s", first ? "" : "\n", ToText(now).c_str());
+            fflush(stdout);
+            last = now;
+            first = false;
+        }
+        if (watch)
+            SleepMs(static_cast<long>(interval * 1000));
+    } while (watch && !g_interrupted);
+    return kExitOk;
 }
 
 }  // namespace kytoupdate

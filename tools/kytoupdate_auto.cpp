@@ -1,0 +1,42 @@
+// auto: the scheduled auto-update job, one run at a time under a lock file.
+#include <fcntl.h>
+#include <sys/file.h>
+
+#include <string>
+
+#include "kyto_paths.h"
+#include "kytoupdate_common.h"
+#include "scoped.h"
+#include "update_cpputil.h"
+
+namespace kytoupdate {
+
+namespace {
+const char* const kAutoLock = "/var/run/kytoupdate-auto.lock";
+}
+
+int CmdAuto() {
+    // One auto-update at a time, whoever starts it (the timer, cron, a person).
+    const kyto::UniqueFd lock(open(kAutoLock, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    if (!lock.valid())
+        return Fail(std::string("cannot open ") + kAutoLock);
+    if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0)
+        return Fail("another automatic update is running");
+    CatchStopSignals();
+    SystemUpdate su;
+    const int rc = CheckAndDownload(su);
+    if (rc == kExitUpToDate)
+        return kExitOk;
+    if (rc >= 0)
+        return rc;
+    if (su.m_updateType == UpdateUtil::PATCH_TYPE_VYX) {
+        Note("the full release is left for the installer");
+        return kExitOk;
+    }
+    // The download ran in a child: take its record (package folder included) back from the
+    // info file before the facade applies it.
+    su.m_smallUpdate.ImportInfoFile(kyto::kAutoUpdateInfoFile);
+    return ApplyWithServices(su.m_smallUpdate, [&su] { return su.Apply() == 1; });
+}
+
+}  // namespace kytoupdate

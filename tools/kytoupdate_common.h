@@ -1,0 +1,67 @@
+// What every command of kytoupdate shares: the exit codes (kytoupdate(1)), the notes and
+// errors on standard error, the stop signals, and the words the commands print for the
+// library's numbers.  Each command is declared here and defined in the file of its concern:
+// kytoupdate_download.cpp, kytoupdate_apply.cpp, kytoupdate_plan.cpp, kytoupdate_auto.cpp
+// and kytoupdate_status.cpp.
+#ifndef KYTOUPDATE_COMMON_H
+#define KYTOUPDATE_COMMON_H
+
+#include <signal.h>
+
+#include <functional>
+#include <string>
+
+#include "smallupdate.h"
+#include "systemupdate.h"
+
+namespace kytoupdate {
+
+// Exit codes.
+constexpr int kExitOk = 0;           // done; for check: an update is available
+constexpr int kExitFailed = 1;       // the operation failed
+constexpr int kExitCannotCheck = 2;  // the update server could not be asked
+constexpr int kExitUpToDate = 3;     // no update: the system is up to date
+constexpr int kExitStopped = 4;      // the download was stopped by a cancel
+constexpr int kExitUsage = 64;       // bad command line
+
+// What SmallUpdate::GetServiceRestartType answers; the library names none of its numbers.
+constexpr int kRestartNone = 0;
+constexpr int kRestartPartial = 1;  // the listed start-up scripts and add-on packages
+constexpr int kRestartAll = 2;      // every start-up script but the invalid-restart ones
+constexpr int kRestartReboot = 3;   // every service through the platform, then a reboot
+
+// Set by SIGINT or SIGTERM once CatchStopSignals ran.
+extern volatile sig_atomic_t g_interrupted;
+void CatchStopSignals();
+void SleepMs(long ms);
+
+// "kytoupdate: <text>" on standard error; Fail returns code for the caller to exit with.
+void Note(const std::string& text);
+int Fail(const std::string& text, int code = kExitFailed);
+
+// Words printed for the library's numbers.
+const char* RestartWord(int restartType);
+std::string KindWord(int patchType);  // a SystemUpdate's m_updateType
+std::string SmallErrnoText(int errorCode);
+
+// ---- Commands (exit codes) ----
+int CmdCheck();
+int CmdDownload();
+int CmdCancel();
+int CmdStatus(bool json, bool watch, double interval);
+int CmdApply();
+int CmdServices(const std::string& action);
+int CmdImport(const std::string& archive);
+int CmdPlan(bool json);
+int CmdAuto();
+
+// Checks, then downloads the update found, choosing su's kind.  An exit code, or -1 when
+// the update was downloaded.
+int CheckAndDownload(SystemUpdate& su);
+// Stops the services the update touches, applies it with applyFn, then starts them again,
+// or, when the update (or a running cluster) needs a reboot, says so and leaves them to it.
+int ApplyWithServices(SmallUpdate& u, const std::function<bool()>& applyFn);
+
+}  // namespace kytoupdate
+
+#endif
