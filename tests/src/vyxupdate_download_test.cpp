@@ -49,7 +49,11 @@ TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
         {R"({"updateType":"vyxupdate","buildnumber":"100",)" + versions + "\"}", false, true},
         {R"({"buildnumber":"0x1644",)" + versions + "\"}", true, false},  // same build in hex
         {R"({"updateType":"smallupdate","buildnumber":"1"})", true, false},
-        {R"({"updateType":"vyxupdate","buildnumber":"5700"})", false, false}};  // no patchPath
+        {R"({"updateType":"vyxupdate","buildnumber":"5700"})", false, false},  // no patchPath
+        // Documents that are not objects: an empty one is nothing to read, others are
+        // unusable and removed like an object without the members.
+        {"[]", true, false}, {R"("x")", false, false}, {"7", false, false},
+        {"true", false, false}};
     // clang-format on
     ServeFeed({{"demo_model", "http://h/demo.img", "00ff"}});
     for (const Case& c : cases) {

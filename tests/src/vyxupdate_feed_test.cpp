@@ -78,7 +78,9 @@ TEST_F(VyxFeedTest, ScannerAcceptsOnlyWellFormedBoundedLinesAndKeepsTheKind) {
 
 // An info object of any shape is judged without throwing and without gaining members.
 TEST_F(VyxFeedTest, DownloadedInfoOfAnyShapeIsJudgedWithoutThrowing) {
-    for (const char* text : {R"(["5","2","9999"])", R"({"majorversion":"5"})"}) {
+    for (const char* text :
+         {R"(["5","2","9999"])", R"({"majorversion":"5"})", R"("x")", "7", "true",
+          R"({"majorversion":{},"minorversion":[],"buildnumber":true})"}) {
         SCOPED_TRACE(text);
         Json::Value info;
         ASSERT_TRUE(Json::Reader().parse(text, info));
