@@ -48,28 +48,6 @@ void VyxUpdate::ConvertTagNameToTagType(std::string name, _tag_rss_tag_type_& ty
     KindOfName(name.data(), name.size(), type);
 }
 
-bool VyxUpdate::ParseTagValue(const std::string& line, std::string& name, std::string& value,
-                              _tag_rss_tag_type_& type) {
-    char left[129];
-    char right[129];
-    std::unique_ptr<char[]> text(new char[4097]);
-    left[0] = right[0] = text[0] = '\0';
-    if (sscanf(line.c_str(), " <%128[^>]>%4096[^<]</%128[^>]>", left, text.get(), right) != 3) {
-        return false;
-    }
-    if (strcmp(left, right) != 0) {
-        syslog(LOG_ERR, "%s:%d Left tag [%s] and right tag [%s] don't match", kModule, __LINE__,
-               left, right);
-        KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, kModule, __LINE__);
-        return false;
-    }
-    name = left;
-    value = text.get();
-    // The kind is not reset: a name outside the table keeps the previous line's kind.
-    ConvertTagNameToTagType(name, type);
-    return true;
-}
-
 namespace {
 
 // The release feed, read in large blocks.  Lines are handed out as ranges of the block
@@ -155,9 +133,11 @@ unsigned FramingTagsIn(const char* line, size_t len) {
     return tags;
 }
 
-// A data line split the way ParseTagValue's scan splits it (" <%128[^>]>%4096[^<]</%128[^>]>",
-// which stops at the first NUL), as ranges of the line.  False when the scan would not
-// fill all three.
+// The one grammar of a data line, used by ParseTagValue and the feed reader: white space,
+// "<", an opening name of 1 to 128 characters other than ">", ">", a value of 1 to 4096
+// characters other than "<", "</", a closing name of 1 to 128 characters other than ">"
+// (longer ones are cut there); the rest of the line, and anything from a NUL on, is not
+// looked at.  The parts are ranges of the line; false when the line does not hold all three.
 struct TagLine {
     const char* left;
     size_t leftLen;
@@ -199,6 +179,16 @@ bool ScanTagLine(const char* s, size_t n, TagLine& t) {
     return t.rightLen != 0;
 }
 
+// True when the opening and closing names agree; otherwise logs both and sets the error.
+bool NamesMatch(const TagLine& t) {
+    if (t.leftLen == t.rightLen && memcmp(t.left, t.right, t.leftLen) == 0)
+        return true;
+    syslog(LOG_ERR, "%s:%d Left tag [%.*s] and right tag [%.*s] don't match", kModule, __LINE__,
+           static_cast<int>(t.leftLen), t.left, static_cast<int>(t.rightLen), t.right);
+    KLIBCErrSetEx(KYTO_ERR_BAD_PARAMETER, kModule, __LINE__);
+    return false;
+}
+
 // Kinds stored into a version field, the fields the wanted-item test reads among them.
 bool IsVersionKind(_tag_rss_tag_type_ type) {
     return type >= RSS_TAG_MAJOR_VER && type <= RSS_TAG_REQ_BUILD_DATE;
@@ -213,6 +203,18 @@ bool ItemIsWanted(bool hotfixOnly, const _tag_vyxinfo_& current, const _tag_vyxi
 }
 
 }  // namespace
+
+bool VyxUpdate::ParseTagValue(const std::string& line, std::string& name, std::string& value,
+                              _tag_rss_tag_type_& type) {
+    TagLine t;
+    if (!ScanTagLine(line.data(), line.size(), t) || !NamesMatch(t))
+        return false;
+    name.assign(t.left, t.leftLen);
+    value.assign(t.value, t.valueLen);
+    // The kind is not reset: a name outside the table keeps the previous line's kind.
+    KindOfName(t.left, t.leftLen, type);
+    return true;
+}
 
 int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool& found,
                             _tag_vyxinfo_& release) {
@@ -260,14 +262,8 @@ int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool&
         }
 
         TagLine t;
-        if (!ScanTagLine(line, len, t))
+        if (!ScanTagLine(line, len, t) || !NamesMatch(t))
             continue;
-        if (t.leftLen != t.rightLen || memcmp(t.left, t.right, t.leftLen) != 0) {
-            // ParseTagValue logs the mismatch and sets the error.
-            std::string name, text;
-            ParseTagValue(std::string(line, len), name, text, type);
-            continue;
-        }
         KindOfName(t.left, t.leftLen, type);
         memcpy(value, t.value, t.valueLen);
         value[t.valueLen] = '\0';
