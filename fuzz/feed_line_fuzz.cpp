@@ -1,7 +1,10 @@
-// Fuzz target: one line of the release feed through VyxUpdate::ParseTagValue, compared
-// with a plain scan of the same line in the feed's one-element-per-line form (opening
-// name of 1..128 characters, value of 1..4096, closing name, names equal).
+// Fuzz target: one line of the release feed through VyxUpdate::ParseTagValue (the line
+// scanner the feed reader uses), compared with a plain scan of the same line in the feed's
+// one-element-per-line form (opening name of 1..128 characters, value of 1..4096, closing
+// name, names equal); then the same line as a whole feed through VyxUpdate::ParseRssFile,
+// which must store what ParseTagValue found, as SetVyxInfo stores it.
 #include <stdio.h>
+#include <string.h>
 
 #include <string>
 
@@ -22,6 +25,33 @@ bool InTable(const std::string& name) {
             return true;
     }
     return false;
+}
+
+constexpr const char* kFeed = "/var/run/autoupdate_tmp_file_RSS";
+
+// The line as the only line of a feed, read for a running system with an empty record: the
+// reader stores the line's value into a zeroed record exactly as ParseTagValue and
+// SetVyxInfo do, unless the line opens or closes a model element (where the model's
+// identity is compared, and the model fields may be cleared again).
+void CheckReaderAgrees(const std::string& line) {
+    const std::string first = line.substr(0, line.find('\n'));
+    if (first.empty() || first.find("<model>") != std::string::npos ||
+        first.find("</model>") != std::string::npos)
+        return;
+    std::string name, value;
+    _tag_rss_tag_type_ type = RSS_TAG_NONE;
+    _tag_vyxinfo_ expected, current, release;
+    memset(&expected, 0, sizeof expected);
+    memset(&current, 0, sizeof current);
+    memset(&release, 0, sizeof release);
+    if (VyxUpdate::ParseTagValue(first, name, value, type))
+        VyxUpdate::SetVyxInfo(type, value.c_str(), expected);
+
+    kytofuzz::WriteWhole(kFeed, first);
+    bool found = true;
+    KYTO_FUZZ_CHECK(VyxUpdate::ParseRssFile(false, current, found, release) == 1);
+    KYTO_FUZZ_CHECK(!found);
+    KYTO_FUZZ_CHECK(memcmp(&expected, &release, sizeof release) == 0);
 }
 
 }  // namespace
@@ -60,6 +90,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     } else {
         KYTO_FUZZ_CHECK(type == RSS_TAG_ITEM_TITLE);
     }
+    CheckReaderAgrees(line);
     kytofuzz::CheckDescriptors();
     return 0;
 }

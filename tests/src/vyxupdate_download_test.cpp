@@ -1,5 +1,5 @@
-// Release check and release download with the real wget and openssl against a loopback
-// update server; download status, progress and cancellation as a second process sees them.
+// The release download with the real wget and openssl against a loopback update server,
+// as the downloading process and a second process see it.
 #include <signal.h>
 #include <unistd.h>
 
@@ -11,59 +11,11 @@
 namespace {
 
 using namespace kytotest;
-const char *kFeedPath = "/autoupdate/genRSS.php", *kStatus = "/var/run/downloadVYX.status",
-           *kPid = "/var/run/downloadVYX.pid", *kInfo = "/autoupd@te.info",
-           *kProgress = "/var/run/downloadprogress";
+const char *kStatus = "/var/run/downloadVYX.status", *kPid = "/var/run/downloadVYX.pid",
+           *kInfo = "/autoupd@te.info", *kProgress = "/var/run/downloadprogress";
 const std::string kFolder = "/volume1/@autoupdate", kSlow = kFolder + "/slow.img";
 
 using VyxServerTest = ReleaseServerTest;
-
-TEST_F(VyxServerTest, CheckAsksOnceAndTheDefaultServerWithoutSetting) {
-    ServeFeed({{"demo_model", "http://h/demo.img", "00ff"}});
-    VyxUpdate vyx;
-    bool haveNew = false, canStart = false;
-    ASSERT_EQ(1, vyx.CheckNewRelease(haveNew));
-    EXPECT_TRUE(haveNew && vyx.PreCheckDownload(canStart) == 1 && canStart);
-    auto requests = server->RequestsFor(kFeedPath);
-    ASSERT_EQ(1u, requests.size());  // the answer is reused
-    EXPECT_EQ("tz=Europe/Berlin demo_model VYX5.2 5644 (autoupgrade)",
-              requests[0].query + " " + requests[0].userAgent);
-
-    // Without rss_server the default server is asked (resolved from the hosts file, never
-    // the machine's name service; nothing listens there).  A refusing server of the facade's
-    // test takes the same path.
-    WriteFile("/etc/hosts", "127.0.0.1 localhost\n127.0.0.1 update.kyto.local\n");
-    SetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server", std::nullopt);
-    EXPECT_EQ(0, VyxUpdate().CheckNewRelease(haveNew));
-    EXPECT_TRUE(SyslogContains(
-        "Fail to exec command [/usr/kyto/bin/wget --user-agent='demo_model VYX5.2 5644 "
-        "(autoupgrade)' -O /var/run/autoupdate_tmp_file_RSS "
-        "http://update.kyto.local/autoupdate/genRSS.php?tz=Europe/Berlin 2> /dev/null]. [0x"));
-}
-
-TEST_F(VyxServerTest, CheckReconcilesAnEarlierDownload) {
-    const std::string image = "/volume9/@autoupdate/old.img",
-                      versions = R"("majorversion":"5","minorversion":"2","patchPath":")" + image;
-    // clang-format off
-    struct Case { std::string info; bool infoKept, progressCleared; } cases[] = {
-        {R"({"updateType":"vyxupdate","buildnumber":"100",)" + versions + "\"}", false, true},
-        {R"({"buildnumber":"0x1644",)" + versions + "\"}", true, false},  // same build in hex
-        {R"({"updateType":"smallupdate","buildnumber":"1"})", true, false},
-        {R"({"updateType":"vyxupdate","buildnumber":"5700"})", false, false}};  // no patchPath
-    // clang-format on
-    ServeFeed({{"demo_model", "http://h/demo.img", "00ff"}});
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.info);
-        WriteFile(kInfo, c.info);
-        WriteFile(image, "partial");
-        WriteFile(kProgress, "Length: 7");
-        bool haveNew = false;
-        ASSERT_EQ(1, VyxUpdate().CheckNewRelease(haveNew));
-        EXPECT_EQ(c.infoKept, PathExists(kInfo));
-        EXPECT_TRUE(PathExists(image));  // images are never deleted by the check
-        EXPECT_EQ(c.progressCleared, !PathExists(kProgress));
-    }
-}
 
 TEST_F(VyxServerTest, RunningDownloadReportsProgressThenRecordsTheImageAndNotifies) {
     pid_t downloader = StartSlowDownload(256 << 10);
@@ -161,84 +113,6 @@ TEST_F(VyxServerTest, HybridPairFetchesBothImagesAndALiveDownloadIsNotRepeated) 
     EXPECT_EQ(0u, server->RequestsFor("/images/vyx.img").size());
     EXPECT_FALSE(PathExists(kStatus) || PathExists(kPid));
     EXPECT_EQ(DownloadNotification(true), RecordedCalls());
-}
-
-// Status, percentage, cancel and installer progress as other processes see them, from files
-// set up by hand.
-using VyxStatusTest = SandboxTest;
-
-TEST_F(VyxStatusTest, StatusFileDecisions) {
-    pid_t dead = Spawn([] { return 0; });
-    Wait(dead);
-    const std::string base =
-        "updateType=\"vyxupdate\"\npatchPath=\"/tmp/img\"\n"
-        "downloadCount=\"2\"\ndownloadNum=\"2\"\ndownloadStatus=";
-    // status and pid file ("": none), what a poller sees.
-    // clang-format off
-    struct Case { std::string status, pid, seen; } cases[] = {
-        {"", "", "none 0"}, {"updateType=smallupdate\ndownloadStatus=2\n", "", "none 0"},
-        {base + "stopped\n", "", "stopped 0"}, {base + "failed\n", "1", "failed 0"},
-        {base + "downloading\n", std::to_string(dead), "failed 0"},
-        {base + "downloading\n", std::to_string(getpid()), "downloading 75"},  // 2nd half done
-        {base + "finish\n", "junk", "refused none 0"},
-        {"updateType=vyxupdate\npatchPath=/x\ndownloadStatus=failed\n", "", "refused none 0"}};
-    // clang-format on
-    // Half of the second image (any page size up to 512 KiB allocates it exactly).
-    WriteFile(kProgress, "--2026-01-01--  http://h/img\nLength: 1,048,576 (1M)\n");
-    WriteFile("/tmp/img", std::string(512 << 10, 'x'));
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.status + " pid " + c.pid);
-        WriteOrRemove(kStatus, c.status.empty() ? nullptr : c.status.c_str());
-        WriteOrRemove(kPid, c.pid.empty() ? nullptr : c.pid.c_str());
-        EXPECT_EQ(c.seen, VyxStatusSeen());
-    }
-    // A complete newer download wins over whatever the status file says.
-    WriteFile(kInfo, R"({"updateType":"vyxupdate","buildnumber":"5700",
-        "majorversion":"5","minorversion":"2","patchPath":"/tmp/img"})");
-    EXPECT_EQ("finished 100", VyxStatusSeen());
-}
-
-// The share of the announced length that is allocated on disk.  Sizes are multiples of
-// 64 KiB so that no page size matters, except where the page of a short file is the point.
-TEST_F(VyxStatusTest, PercentageOfOneImage) {
-    // clang-format off
-    struct Case { std::string log; size_t bytes; bool sparse; int percentage; } cases[] = {
-        {"no size line here\n", 65536, false, 0},
-        {"Length: 131,072 (128K) [application/octet-stream]\n", 131072, false, 100},
-        {"Length: 1,310,720 (1.2M)\n", 655360, false, 50},
-        {"Length: 1,310,720 (1.2M)\n", 1310720, true, 0},  // the length only, nothing allocated
-        {"Length: 1,000 (1K)\n", 1000, false, static_cast<int>(sysconf(_SC_PAGESIZE) / 10)}};
-    // clang-format on
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.log);
-        WriteFile(kProgress, c.log);
-        WriteFile("/tmp/img", c.sparse ? "" : std::string(c.bytes, 'x'));
-        ASSERT_EQ(0, truncate("/tmp/img", static_cast<off_t>(c.bytes)));
-        int percentage = -1;
-        ASSERT_TRUE(VyxUpdate::GetDownloadPercentage("/tmp/img", percentage));
-        EXPECT_EQ(c.percentage, percentage);
-    }
-    int percentage = 0;
-    unlink(kProgress);
-    EXPECT_FALSE(VyxUpdate::GetDownloadPercentage("/tmp/img", percentage));
-    EXPECT_TRUE(SyslogContains("Fail to open file [/var/run/downloadprogress] for reading"));
-}
-
-// A cancel without a pid file is the facade's case.
-TEST_F(VyxStatusTest, CancelWithoutDownloadAndInstallerProgress) {
-    WriteFile(kPid, "0");
-    EXPECT_FALSE(VyxUpdate::CancelDownloadVyx());
-    // clang-format off
-    struct Case { _tag_update_step_ step; int number; std::string text, line; } cases[] = {
-        {UPDATE_STEP_U, -1, "unpacking", "U:unpacking\n"}, {UPDATE_STEP_U, 30, "x", "U:30:\n"},
-        {UPDATE_STEP_R, -1, "x", "R:-1:\n"}};
-    // clang-format on
-    for (const Case& c : cases) {
-        EXPECT_TRUE(VyxUpdate::ReportProgress(c.step, c.number, c.text.c_str()));
-        EXPECT_EQ(c.line, ReadFile("/tmp/update.progress"));
-    }
-    // A text longer than the command buffer makes a command the shell refuses, nothing more.
-    EXPECT_FALSE(VyxUpdate::ReportProgress(UPDATE_STEP_U, -1, std::string(200, 't').c_str()));
 }
 
 }  // namespace

@@ -1,0 +1,122 @@
+// VyxUpdate: version records (the running system's, filled from its version files, and
+// a release's, filled line by line from the feed) and the three version comparisons.
+#include "vyxupdate.h"
+
+#include <stdio.h>
+#include <string.h>
+#include <syslog.h>
+
+#include <kytoplatform/klibc.h>
+
+#include "kyto_paths.h"
+#include "platform_error.h"
+#include "vyxupdate_internal.h"
+
+using namespace kyto::vyx;
+
+int VyxUpdate::GetVyxInfo(_tag_vyxinfo_& info) {
+    struct Source {
+        const char* file;
+        const char* key;
+        char* field;
+        int size;
+    };
+    const Source sources[] = {
+        {kyto::kVersionFile, "majorversion", info.major, sizeof(info.major)},
+        {kyto::kVersionFile, "minorversion", info.minor, sizeof(info.minor)},
+        {kyto::kVersionFile, "buildphase", info.buildPhase, sizeof(info.buildPhase)},
+        {kyto::kVersionFile, "buildnumber", info.buildNum, sizeof(info.buildNum)},
+        {kyto::kVersionFile, "builddate", info.buildDate, sizeof(info.buildDate)},
+        {kyto::kInfoConfFile, "unique", info.unique, sizeof(info.unique)},
+    };
+    for (const Source& src : sources) {
+        if (KLIBCFileGetKeyValue(src.file, src.key, src.field, src.size, 0) < 1) {
+            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, src.key,
+                   src.file, kyto::LastErrorText().c_str());
+            return 0;
+        }
+    }
+    return 1;
+}
+
+void VyxUpdate::SetVyxInfo(const _tag_rss_tag_type_& type, const char* value, _tag_vyxinfo_& info) {
+    if (value == nullptr)
+        return;
+    char* field = nullptr;
+    size_t size = 0;
+    switch (type) {
+        case RSS_TAG_MAJOR_VER:
+            field = info.major, size = sizeof(info.major);
+            break;
+        case RSS_TAG_MINOR_VER:
+            field = info.minor, size = sizeof(info.minor);
+            break;
+        case RSS_TAG_BUILD_PHASE:
+            field = info.buildPhase, size = sizeof(info.buildPhase);
+            break;
+        case RSS_TAG_BUILD_NUM:
+            field = info.buildNum, size = sizeof(info.buildNum);
+            break;
+        case RSS_TAG_BUILD_DATE:
+            field = info.buildDate, size = sizeof(info.buildDate);
+            break;
+        case RSS_TAG_REQ_MAJOR_VER:
+            field = info.reqMajor, size = sizeof(info.reqMajor);
+            break;
+        case RSS_TAG_REQ_MINOR_VER:
+            field = info.reqMinor, size = sizeof(info.reqMinor);
+            break;
+        case RSS_TAG_REQ_BUILD_PHASE:
+            field = info.reqBuildPhase, size = sizeof(info.reqBuildPhase);
+            break;
+        case RSS_TAG_REQ_BUILD_NUM:
+            field = info.reqBuildNum, size = sizeof(info.reqBuildNum);
+            break;
+        case RSS_TAG_REQ_BUILD_DATE:
+            field = info.reqBuildDate, size = sizeof(info.reqBuildDate);
+            break;
+        case RSS_TAG_M_UNIQUE:
+            field = info.unique, size = sizeof(info.unique);
+            break;
+        case RSS_TAG_M_LINK:
+            field = info.link, size = sizeof(info.link);
+            break;
+        case RSS_TAG_M_CHECKSUM:
+            field = info.checksum, size = sizeof(info.checksum);
+            break;
+        default:  // channel and item framing, "model": nothing to store
+            return;
+    }
+    snprintf(field, size, "%s", value);
+}
+
+int VyxUpdate::IsVersionNewer(const _tag_vyxinfo_& current, const _tag_vyxinfo_& candidate) {
+    long curMajor = ToNumber(current.major);
+    long newMajor = ToNumber(candidate.major);
+    if (newMajor != curMajor)
+        return newMajor > curMajor ? 1 : 0;
+    long curMinor = ToNumber(current.minor);
+    long newMinor = ToNumber(candidate.minor);
+    if (newMinor != curMinor)
+        return newMinor > curMinor ? 1 : 0;
+    return ToNumber(candidate.buildNum) > ToNumber(current.buildNum) ? 1 : 0;
+}
+
+int VyxUpdate::IsHotfix(const _tag_vyxinfo_& current, const _tag_vyxinfo_& candidate) {
+    return (ToNumber(candidate.major) == ToNumber(current.major) &&
+            ToNumber(candidate.minor) == ToNumber(current.minor))
+               ? 1
+               : 0;
+}
+
+int VyxUpdate::SatisfyReqVersion(const _tag_vyxinfo_& current, const _tag_vyxinfo_& candidate) {
+    // Any one of the three is enough: the requirement is deliberately not compared as a
+    // version triple.
+    if (ToNumber(current.major) >= ToNumber(candidate.reqMajor))
+        return 1;
+    if (ToNumber(current.minor) >= ToNumber(candidate.reqMinor))
+        return 1;
+    if (ToNumber(current.buildNum) >= ToNumber(candidate.reqBuildNum))
+        return 1;
+    return 0;
+}
