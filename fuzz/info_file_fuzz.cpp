@@ -4,13 +4,17 @@
 // GetDownloadStatus, CheckPatchAndUpdateType).  An accepted file leaves error code 0 and
 // reads as a finished download; a refused one leaves code 3 (bad document) or 4 (other
 // build).  The full-system readers never throw: a document that is not JSON fails them,
-// any other shape is used or set aside.
+// any other shape is used or set aside.  Last, the facade's readers: a fresh SystemUpdate
+// imports no kind from any file and applies nothing, and UpdateUtil's kind reader names a
+// full release only for an object whose "updateType" is "vyxupdate".
 #include <exception>
 #include <sstream>
 #include <string>
 
 #include "fuzz_common.h"
 #include "smallupdate.h"
+#include "systemupdate.h"
+#include "update_cpputil.h"
 #include "vyxupdate.h"
 
 namespace {
@@ -92,6 +96,27 @@ void CheckVyxReaders(const uint8_t* data, size_t size) {
     KYTO_FUZZ_CHECK(root == before);
 }
 
+void CheckFacadeReaders(const uint8_t* data, size_t size) {
+    const std::string text(reinterpret_cast<const char*>(data), size);
+    Json::Value root;
+    const bool parses = ParseDocument(text, root);
+
+    kytofuzz::WriteWhole(kInfo, text);
+    KYTO_FUZZ_CHECK(SystemUpdate().ImportInfoFile() == 0);
+    kytofuzz::WriteWhole(kInfo, text);
+    KYTO_FUZZ_CHECK(SystemUpdate().Apply() == 0);
+
+    kytofuzz::WriteWhole(kInfo, text);
+    UpdateUtil::PATCH_TYPE type = UpdateUtil::PATCH_TYPE_NONE;
+    UpdateUtil::CheckDownloadedPatchType(type);
+    const bool vyx = parses && root.isObject() && root["updateType"].isString() &&
+                     root["updateType"].asString() == "vyxupdate";
+    if (vyx)
+        KYTO_FUZZ_CHECK(type == UpdateUtil::PATCH_TYPE_VYX);
+    else
+        KYTO_FUZZ_CHECK(type != UpdateUtil::PATCH_TYPE_VYX);
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char*** argv) {
@@ -103,6 +128,7 @@ extern "C" int LLVMFuzzerInitialize(int*, char*** argv) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     CheckSmallUpdateReaders(data, size);
     CheckVyxReaders(data, size);
+    CheckFacadeReaders(data, size);
     kytofuzz::CheckDescriptors();
     return 0;
 }
