@@ -23,12 +23,13 @@
 #include "kyto_paths.h"
 #include "platform_error.h"
 #include "scoped.h"
+#include "smallupdate_internal.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
 
-namespace {
+using namespace kyto::small;
 
-constexpr const char* kModule = "smallupdate";
+namespace {
 
 // Base address of the patch lists when "small_info_path" is not configured.
 constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
@@ -59,7 +60,7 @@ class CurlEasy {
 
 // Installed small-fix number: "smallfixnumber" of the version file, 0 when it yields nothing.
 int InstalledSmallFixNumber() {
-    char buf[32] = {0};
+    char buf[kInstalledFixWidth] = {0};
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", buf, sizeof(buf), 0) <= 0) {
         return 0;
     }
@@ -265,14 +266,14 @@ bool SmallUpdate::HaveNewFix() {
 }
 
 bool SmallUpdate::CheckPatchIsSmallUpdate(const std::string& archive, bool& isSmallUpdate) {
-    char command[512] = {0};
+    char command[kArchiveCommandWidth] = {0};
     snprintf(command, sizeof(command), "/bin/tar -tf %s | /bin/grep '%s' | wc -l", archive.c_str(),
              kPatchListName);
     kyto::UniqueFile pipe(popen(command, "re"), kyto::UniqueFile::kPopen);
     if (!pipe) {
         return false;
     }
-    char line[256] = {0};
+    char line[kArchiveCountLineWidth] = {0};
     if (fgets(line, sizeof(line), pipe.get()) == nullptr) {
         return false;
     }
@@ -328,7 +329,7 @@ std::string SmallUpdate::GetFullVersion() {
         return std::string();
     }
     // The display text is cut to 63 characters, as the interface shows it.
-    char text[64] = {0};
+    char text[kFullVersionWidth] = {0};
     if (snprintf(text, sizeof(text), "VYX %s.%s-%s update %d", info.major, info.minor,
                  info.buildNum, m_newSmallFixNumber) < 0) {
         return std::string();
