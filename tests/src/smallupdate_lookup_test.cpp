@@ -34,14 +34,15 @@ class SmallUpdateLookupTest : public UpdateServerTest {
                   {pkg, server->Url("/debs/" + Deb(pkg, fix))}};
         return e;
     }
-    // Two fixes older than the installed 3, then a configuration fix 4 and a flash fix 5.
+    // Two fixes older than the installed 3, then a flash fix 5 and a configuration fix 4:
+    // the list need not be in ascending order.
     std::vector<PatchEntry> RealisticList() {
-        std::vector<PatchEntry> list = {Entry(1, "\"reboot\""), Entry(2), Entry(4), Entry(5)};
-        list[2].config = true;
-        list[2].restart = "{\"vyx_service\":[\"samba\"],\"pkg\":[]}";
-        list[3].flash = true;
-        list[3].restart = "{\"vyx_service\":[\"samba\",\"sshd\"],\"pkg\":[\"web\"]}";
-        list[3].proj.push_back({"flashupdate", server->Url("/debs/" + Deb("flash", 5))});
+        std::vector<PatchEntry> list = {Entry(1, "\"reboot\""), Entry(2), Entry(5), Entry(4)};
+        list[3].config = true;
+        list[3].restart = "{\"vyx_service\":[\"samba\"],\"pkg\":[]}";
+        list[2].flash = true;
+        list[2].restart = "{\"vyx_service\":[\"samba\",\"sshd\"],\"pkg\":[\"web\"]}";
+        list[2].proj.push_back({"flashupdate", server->Url("/debs/" + Deb("flash", 5))});
         return list;
     }
 };
@@ -63,7 +64,7 @@ TEST_F(SmallUpdateLookupTest, NewerEntriesOfThisBuildAndModelFillTheRecord) {
     EXPECT_EQ(Deb("flash", 5), u.m_flashUpdateDeb);
     EXPECT_TRUE(u.m_blFlashUpdate && u.m_blConfigUpdate);
     EXPECT_FALSE(u.m_blNeedReboot || u.m_blRestartAllService) << "the reboot of fix 1 is older";
-    EXPECT_EQ((std::vector<std::string>{Deb("fix4", 4), Deb("fix5", 5)}), u.m_installDebs);
+    EXPECT_EQ((std::vector<std::string>{Deb("fix5", 5), Deb("fix4", 4)}), u.m_installDebs);
     EXPECT_EQ((std::vector<std::string>{"samba", "sshd"}), u.m_vyxServiceRestartList);
     EXPECT_EQ((std::vector<std::string>{"web"}), u.m_pkgRestartList);
     EXPECT_EQ("VYX 5.2-5644 update 5", u.GetFullVersion());
