@@ -14,46 +14,14 @@ const char *kStatus = "/var/run/downloadVYX.status", *kInfo = "/autoupd@te.info"
 const std::string kDir = "/volume1//@smallupd@te_deb";
 const auto Deb = [](const std::string& name) { return SmallFixDebName(name, 5); };
 
-std::string Status() {
-    int percentage = 7;
-    std::string word;
-    SmallUpdate().GetDownloadStatus(percentage, word);
-    return std::to_string(percentage) + " " + word;
-}
-
-class SmallUpdateDownloadTest : public UpdateServerTest {
-  protected:
-    void SetUp() override {
-        UpdateServerTest::SetUp();
-        u.m_newSmallFixNumber = 5;  // a filled record: the server's list is not asked
-        u.m_buildNumber = 5644;
-        u.m_blRestartAllService = true;
-    }
-    // Serves further packages of 48 KiB each and the small-update package that comes with
-    // them (fetched last), and puts them into the record in place of earlier ones.
-    void Packages(const std::vector<std::string>& names, long bytesPerSecond = 0) {
-        u.m_installDebs.clear();
-        u.m_installDebLinks.clear();
-        std::vector<std::string> all = names;
-        all.push_back("small" + names.front());
-        for (const std::string& name : all) {
-            server->PutFileOfSize("/debs/" + Deb(name), 48 << 10);
-            if (bytesPerSecond)
-                server->SlowPath("/debs/" + Deb(name), bytesPerSecond);
-            (name == all.back() ? u.m_smallUpdateDeb : u.m_installDebs.emplace_back()) = Deb(name);
-            (name == all.back() ? u.m_smallUpdateDebLink : u.m_installDebLinks.emplace_back()) =
-                server->Url("/debs/" + Deb(name));
-        }
-    }
-    SmallUpdate u;
-};
+using SmallUpdateDownloadTest = SmallDownloadTest;
 
 TEST_F(SmallUpdateDownloadTest, PollerInAnotherProcessSeesEveryFileAndThenTheInfoFile) {
     Packages({"pa", "pb"}, 192 << 10);
     const pid_t poller = Spawn([] {
         std::string seen, last, now;
         for (int i = 0; i < 30000 && now != "100 finished"; ++i, usleep(2000)) {
-            now = Status();
+            now = SmallDownloadSeen();
             if (now != "7 none" && now != last)
                 seen += (last = now) + "\n";
         }
@@ -84,7 +52,7 @@ TEST_F(SmallUpdateDownloadTest, RetriesAreCountedAndTheTenthFailureEndsTheDownlo
     EXPECT_EQ(4u, server->RequestsFor("/debs/" + Deb("ra")).size());
     EXPECT_EQ(10u, server->RequestsFor("/debs/" + Deb("rb")).size());
     EXPECT_TRUE(server->RequestsFor("/debs/" + Deb("r6")).empty());
-    EXPECT_EQ("57 failed", Status());
+    EXPECT_EQ("57 failed", SmallDownloadSeen());
     EXPECT_FALSE(PathExists(kDir) || PathExists(kInfo));
     EXPECT_TRUE(SyslogContains("failed to exec cmd=[/usr/kyto/bin/wget " + u.m_installDebLinks[4] +
                                    " -O " + kDir + "/" + Deb("rb") +
@@ -139,7 +107,7 @@ TEST_F(SmallUpdateDownloadTest, WhatIsFetchedAndWhatCountsAsDownloaded) {
     WriteFile(kStatus, "updateType=smallupdate\npercentage=\"0\"\ndownloadStatus=\"4\"\n");
     ASSERT_TRUE(u.Download(true));
     EXPECT_TRUE(server->Requests().empty());
-    EXPECT_EQ("100 finished", Status());
+    EXPECT_EQ("100 finished", SmallDownloadSeen());
 
     // With a configuration update it is; a flash package only with its flag.
     u.m_blConfigUpdate = u.m_blFlashUpdate = true;
@@ -159,9 +127,9 @@ TEST_F(SmallUpdateDownloadTest, WhatIsFetchedAndWhatCountsAsDownloaded) {
     // Without an info file the status file tells; a state beyond the table is a failure.
     RemoveTree(kInfo);
     WriteFile(kStatus, "percentage=\"42\"\ndownloadStatus=\"-1\"\n");
-    EXPECT_EQ("42 failed", Status());
+    EXPECT_EQ("42 failed", SmallDownloadSeen());
     RemoveTree(kStatus);
-    EXPECT_EQ("7 none", Status());
+    EXPECT_EQ("7 none", SmallDownloadSeen());
 }
 
 }  // namespace
