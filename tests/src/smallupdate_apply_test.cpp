@@ -16,13 +16,9 @@ TEST_F(SmallUpdateApplyTest, EndingsFailingStepsAndTheCleanUp) {
     enum Kind { kPartial, kReboot, kCluster, kBadPackage, kNotLoaded, kNoConfigUpdater, kNoFlash };
     // Apply status (as ApplyStageSeen tells it), stamped update log lines, "smallfixnumber"
     // afterwards, failing step's message.
-    struct Row {
-        Kind kind;
-        std::string status;
-        std::vector<std::string> log;
-        const char* fix;
-        std::string syslog;
-    } rows[] = {
+    // clang-format off
+    struct Row { Kind kind; std::string status; std::vector<std::string> log; const char* fix;
+                 std::string syslog; } rows[] = {
         {kPartial, "100 program caller-err", {kStart, "Finished update!"}, "6", ""},
         {kReboot, "100 reboot caller-err", {kStart, "Finished update before reboot!"}, "6", ""},
         {kCluster, "100 reboot caller-err", {kStart, "Finished update before reboot!"}, "6", ""},
@@ -31,6 +27,7 @@ TEST_F(SmallUpdateApplyTest, EndingsFailingStepsAndTheCleanUp) {
         {kNoConfigUpdater, "20 program err_system", {kStart}, "3", "failed to do config update"},
         {kNoFlash, "0 program err_system", {kStart}, "3", "failed to update flash"},
     };
+    // clang-format on
     const std::string configUpdate = "#!/bin/sh\necho \"$@\" > /tmp/configupdate.args\n";
     for (const Row& row : rows) {
         SCOPED_TRACE(row.kind);

@@ -17,13 +17,8 @@ using ServicesTest = SandboxTest;
 // partial restart runs the listed scripts, then the listed packages, in list order.
 TEST_F(ServicesTest, StopAndStartOfEachRestartType) {
     const std::vector<std::string> kScripts = {"S01iptables.sh", "S20samba.sh", "S99sshd.sh"};
-    struct Row {
-        std::function<void(SmallUpdate&)> set;
-        Calls stop, start;
-        int type;
-        std::string log;
-    };
     // clang-format off
+    struct Row { std::function<void(SmallUpdate&)> set; Calls stop, start; int type; std::string log; };
     const Row rows[] = {
         {[](SmallUpdate& u) { u.m_blNeedReboot = u.m_blRestartAllService = true; },
          {{"S99sshd.sh", "stop", "none"}, {"S20samba.sh", "stop", "none"},
