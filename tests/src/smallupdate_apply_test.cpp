@@ -14,8 +14,7 @@ using SmallUpdateApplyTest = ApplyStepsTest;
 
 TEST_F(SmallUpdateApplyTest, EndingsFailingStepsAndTheCleanUp) {
     enum Kind { kPartial, kReboot, kCluster, kBadPackage, kNotLoaded, kNoConfigUpdater, kNoFlash };
-    // Apply status (as ApplyStageSeen tells it), stamped update log lines, "smallfixnumber"
-    // afterwards, failing step's message.
+    // ApplyStageSeen, stamped update log, "smallfixnumber" after, failing step's message.
     // clang-format off
     struct Row { Kind kind; std::string status; std::vector<std::string> log; const char* fix;
                  std::string syslog; } rows[] = {

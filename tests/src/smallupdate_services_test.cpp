@@ -10,11 +10,10 @@ const char* kApplyStatus = "/var/run/applySmallUpd@te.status";
 const char* kInvalidList = "/usr/kyto/etc.defaults/invalid_restart_service";
 using ServicesTest = SandboxTest;
 
-// Stop walks backwards, start forwards.  A reboot-type update goes through the platform
-// (every script, no status); a restart-all skips the invalid scripts (trailing blanks of a
-// list line do not hide one), counts 100 / 3 per started script and ends with the add-ons,
-// and switches nothing without an invalid list or scripts, but still tells "finished"; a
-// partial restart runs the listed scripts, then the listed packages, in list order.
+// Stop walks backwards, start forwards.  A reboot-type update goes through the platform; a
+// restart-all skips the invalid scripts (trailing blanks do not hide one), counts 100 / 3
+// per started script, ends with the add-ons, and without an invalid list or scripts switches
+// nothing but still tells "finished"; a partial restart runs the listed scripts and packages.
 TEST_F(ServicesTest, StopAndStartOfEachRestartType) {
     const std::vector<std::string> kScripts = {"S01iptables.sh", "S20samba.sh", "S99sshd.sh"};
     // clang-format off
@@ -50,6 +49,7 @@ TEST_F(ServicesTest, StopAndStartOfEachRestartType) {
           {"kytopkg", "stop PkgB", "none"}, {"kytopkg", "stop PkgA", "none"}},
          {{"S99sshd.sh", "start", "none"}, {"S01iptables.sh", "start", "none"},
           {"kytopkg", "start PkgB", "none"}, {"kytopkg", "start PkgA", "none"}}, 1, ""},
+        {[](SmallUpdate&) {}, {}, {}, 0, ""},  // nothing to restart
     };
     // clang-format on
     for (const Row& row : rows) {
@@ -68,15 +68,13 @@ TEST_F(ServicesTest, StopAndStartOfEachRestartType) {
         ClearRecordedCalls();
         u.SwitchServices(true);
         EXPECT_EQ(row.start, RecordedCalls());
-        EXPECT_EQ(row.type == 3 ? "" : "percentage=\"100\"\nstage=\"5\"\nErrMsg=\"\"\n",
+        EXPECT_EQ(row.type % 3 == 0 ? "" : "percentage=\"100\"\nstage=\"5\"\nErrMsg=\"\"\n",
                   ReadFile(kApplyStatus).value_or(""));
         EXPECT_TRUE(row.log.empty() || SyslogContains(row.log, LOG_ERR));
         EXPECT_EQ(row.type, u.GetServiceRestartType());
     }
-    SmallUpdate nothing, notLoaded;  // nothing to restart; not loaded, no info file to load
-    nothing.m_newSmallFixNumber = 3;
+    SmallUpdate notLoaded;  // and no info file to load
     notLoaded.m_blNeedReboot = true;
-    EXPECT_EQ(0, nothing.GetServiceRestartType());
     EXPECT_EQ(0, notLoaded.GetServiceRestartType());
 }
 
