@@ -1,5 +1,4 @@
-// Downloading a small update with wget from the loopback server: the status file seen by a
-// poller, retries in the server's log, the stop marker from another process, the info file.
+// Downloading a small update with wget from the loopback server: status, retries, stop marker.
 #include <algorithm>
 
 #include "engine_fixtures.h"
@@ -29,8 +28,7 @@ TEST_F(SmallUpdateDownloadTest, RetriesAreCountedAndTheTenthFailureEndsTheDownlo
                                    " -O " + kDir + "/" + Deb("rb") +
                                    " --timeout=15 --tries=1], r=8",
                                LOG_ERR));
-    // A link without a folder is refused before wget runs, ten times.
-    EXPECT_FALSE(SmallUpdate::ExecWgetWithRetry("nolink.deb", "/tmp"));
+    EXPECT_FALSE(SmallUpdate::ExecWgetWithRetry("nolink.deb", "/tmp"));  // no folder: ten refusals
     const std::vector<std::string> logged = SyslogMessages(LOG_ERR);
     EXPECT_EQ(10, std::count_if(logged.begin(), logged.end(), [](const std::string& m) {
                   return m.find("Wrong download link [nolink.deb]") != std::string::npos;

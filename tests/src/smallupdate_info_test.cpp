@@ -1,5 +1,4 @@
-// The small-update record: Equal and the info files, also as a poller in another process
-// sees them while they are rewritten.
+// The small-update record: Equal and the info files, also as a poller in another process sees them.
 #include "engine_fixtures.h"
 #include "update_cpputil.h"
 
@@ -100,9 +99,9 @@ TEST_F(SmallUpdateInfoTest, DumpWritesOneRestartBranchAndReadsBack) {
     // No installDeb, no lists: emptied; a flash flag set before is kept.  Members convert as
     // jsoncpp does (1 reads as true, an array for a text as empty, nothing throws).
     // clang-format off
-    WriteSmallInfo({{"blNeedReboot", "true"}, {"blRestartAllService", "1"}, {"smallupdateDeb", "[]"},
-                    {"flashupdateDeb", "\"\""}, {"vyxServiceRestartList", nullptr},
-                    {"pkgRestartList", nullptr}});
+    WriteSmallInfo({{"blNeedReboot", "true"}, {"blRestartAllService", "1"},
+                    {"smallupdateDeb", "[]"}, {"flashupdateDeb", "\"\""},
+                    {"vyxServiceRestartList", nullptr}, {"pkgRestartList", nullptr}});
     // clang-format on
     EXPECT_NO_THROW(EXPECT_TRUE(back.ImportInfoFile(kInfo)));
     EXPECT_TRUE(back.m_installDebs.empty() && back.m_pkgRestartList.empty() &&

@@ -1,5 +1,4 @@
-// Service stop and start around a small-update apply, as the start-up scripts, the package
-// control program and the interface's poller of the apply status file see them.
+// Service stop and start around an apply, as the scripts and the apply status file show them.
 #include "engine_fixtures.h"
 
 namespace {
@@ -17,7 +16,8 @@ using ServicesTest = SandboxTest;
 TEST_F(ServicesTest, StopAndStartOfEachRestartType) {
     const std::vector<std::string> kScripts = {"S01iptables.sh", "S20samba.sh", "S99sshd.sh"};
     // clang-format off
-    struct Row { std::function<void(SmallUpdate&)> set; Calls stop, start; int type; std::string log; };
+    struct Row { std::function<void(SmallUpdate&)> set; Calls stop, start; int type;
+                 std::string log; };
     const Row rows[] = {
         {[](SmallUpdate& u) { u.m_blNeedReboot = u.m_blRestartAllService = true; },
          {{"S99sshd.sh", "stop", "none"}, {"S20samba.sh", "stop", "none"},
