@@ -10,6 +10,7 @@
 #include <unistd.h>
 
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include <json/json.h>
@@ -49,30 +50,20 @@ int SmallUpdate::GetErrno() {
 }
 
 bool SmallUpdate::Equal(const SmallUpdate& other) const {
-    if (m_blConfigUpdate != other.m_blConfigUpdate)
-        return false;
-    if (m_blFlashUpdate != other.m_blFlashUpdate)
-        return false;
-    if (m_newSmallFixNumber != other.m_newSmallFixNumber)
-        return false;
-    if (m_debDir != other.m_debDir)
-        return false;
-    if (!UpdateUtil::CompareVector(m_installDebLinks, other.m_installDebLinks))
-        return false;
-    if (m_smallUpdateDeb != other.m_smallUpdateDeb)
-        return false;
-    if (m_flashUpdateDeb != other.m_flashUpdateDeb)
-        return false;
-    if (!UpdateUtil::CompareVector(m_installDebs, other.m_installDebs))
-        return false;
-    if (m_blRestartAllService != other.m_blRestartAllService)
-        return false;
-    if (m_blNeedReboot != other.m_blNeedReboot)
-        return false;
-    if (!UpdateUtil::CompareVector(m_vyxServiceRestartList, other.m_vyxServiceRestartList)) {
-        return false;
-    }
-    return UpdateUtil::CompareVector(m_pkgRestartList, other.m_pkgRestartList) == 1;
+    // The identity (model, build, error code) and the links of the single packages do not
+    // count; the lists are compared without regard to their order.
+    auto scalars = [](const SmallUpdate& u) {
+        return std::tie(u.m_blConfigUpdate, u.m_blFlashUpdate, u.m_newSmallFixNumber, u.m_debDir,
+                        u.m_smallUpdateDeb, u.m_flashUpdateDeb, u.m_blRestartAllService,
+                        u.m_blNeedReboot);
+    };
+    auto sameList = [&other, this](std::vector<std::string> SmallUpdate::*list) {
+        return UpdateUtil::CompareVector(this->*list, other.*list) == 1;
+    };
+    return scalars(*this) == scalars(other) && sameList(&SmallUpdate::m_installDebLinks) &&
+           sameList(&SmallUpdate::m_installDebs) &&
+           sameList(&SmallUpdate::m_vyxServiceRestartList) &&
+           sameList(&SmallUpdate::m_pkgRestartList);
 }
 
 namespace {
