@@ -16,12 +16,12 @@
 
 #include "debian_lib.h"
 #include "kyto_paths.h"
+#include "smallupdate_internal.h"
 #include "update_cpputil.h"
 
-namespace {
+using namespace kyto::small;
 
-constexpr const char* kModule = "smallupdate";
-constexpr const char* kErrSystem = "err_system";
+namespace {
 
 // The steps of one apply up to the new small-fix number.  `percentage` and `stage` follow
 // what the poller was last shown, so that a failure can be reported where it happened.
@@ -31,7 +31,7 @@ bool RunApplySteps(SmallUpdate& update, int& percentage, SmallUpdate::APPLY_STAG
     if (update.m_newSmallFixNumber < 0 && !update.IsReadyApply())
         return false;
 
-    char installed[8] = {0};
+    char installed[kApplyFixWidth] = {0};
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", installed, sizeof(installed),
                              0) <= 0)
         snprintf(installed, sizeof(installed), "%s", "0");
@@ -72,7 +72,7 @@ bool RunApplySteps(SmallUpdate& update, int& percentage, SmallUpdate::APPLY_STAG
 
     // Written only once every package is in: a failure here leaves the old number, and the
     // next check offers the fix again.
-    char fix[8] = {0};
+    char fix[kApplyFixWidth] = {0};
     snprintf(fix, sizeof(fix), "%d", update.m_newSmallFixNumber);
     return KLIBCFileSetKeyValue(kyto::kVersionFile, "smallfixnumber", fix, nullptr) > 0;
 }
@@ -96,7 +96,7 @@ bool SmallUpdate::Apply() {
 
     // Every apply, successful or not, consumes the downloaded packages and the info files,
     // so that a broken download is never applied twice.
-    char passiveDir[4095] = {0};
+    char passiveDir[kPassiveDirWidth] = {0};
     if (KLIBCFileGetKeyValue(kyto::kPassiveInfoFile, "debDir", passiveDir, sizeof(passiveDir), 0) >
         0) {
         UpdateUtil::RemoveFolder(passiveDir);

@@ -20,21 +20,70 @@
 #include "kyto_paths.h"
 #include "platform_error.h"
 #include "scoped.h"
+#include "smallupdate_internal.h"
+#include "smallupdate_plan.h"
 #include "update_cpputil.h"
+
+using namespace kyto::small;
 
 namespace {
 
-constexpr const char* kModule = "smallupdate";
-constexpr const char* kStopMarker = "/tmp/stop_download_smallfix";
 // Each wget run makes one try; the retries are counted here.
 constexpr int kWgetAttempts = 10;
 
-const char* const kDownloadWords[] = {
-    "none", "init", "downloading", "finished", "failed", "stopped",
-};
-
 bool StopRequested() {
     return KLIBCFileExist(kStopMarker) != 0;
+}
+
+void LogProgressFailure(int line) {
+    syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, line);
+}
+
+// A failed download: the status file says so at the percentage reached, the package folder
+// goes.  Always false.
+bool FailDownload(int percentage, const std::string& debDir) {
+    if (!SmallUpdate::UpdateDownloadProgress(percentage, SmallUpdate::DOWNLOAD_STATUS_FAILED)) {
+        LogProgressFailure(__LINE__);
+    }
+    UpdateUtil::RemoveFolder(debDir);
+    return false;
+}
+
+// Announces a new download ("init") and empties its package folder.
+bool StartDownload(const std::string& debDir) {
+    unlink(kyto::kDownloadStatusFile);
+    if (!SmallUpdate::UpdateDownloadProgress(0, SmallUpdate::DOWNLOAD_STATUS_INIT)) {
+        LogProgressFailure(__LINE__);
+        return false;
+    }
+    // A marker left over from an earlier, already stopped download does not stop this one.
+    if ((StopRequested() && unlink(kStopMarker) != 0) || UpdateUtil::CleanFolder(debDir) != 1) {
+        syslog(LOG_ERR, "%s:%d Failed to cleam folder %m", kModule, __LINE__);
+        return false;
+    }
+    return true;
+}
+
+enum class Fetched { kAll, kStopped, kFailed };
+
+// Fetches the links one after another into debDir; percentage follows the files done.
+Fetched FetchLinks(const std::vector<std::string>& links, const std::string& debDir,
+                   int& percentage) {
+    for (size_t i = 0; i < links.size(); ++i) {
+        if (StopRequested()) {
+            return Fetched::kStopped;
+        }
+        if (!SmallUpdate::ExecWgetWithRetry(links[i], debDir)) {
+            return Fetched::kFailed;
+        }
+        percentage = static_cast<int>(100 * (i + 1) / links.size());
+        if (!StopRequested() && !SmallUpdate::UpdateDownloadProgress(
+                                    percentage, SmallUpdate::DOWNLOAD_STATUS_DOWNLOADING)) {
+            LogProgressFailure(__LINE__);
+            return Fetched::kFailed;
+        }
+    }
+    return Fetched::kAll;
 }
 
 }  // namespace
@@ -48,7 +97,7 @@ bool SmallUpdate::ExecWgetP(const std::string& link, const std::string& folder) 
         syslog(LOG_ERR, "%s:%d Wrong download link [%s]", kModule, __LINE__, link.c_str());
         return false;
     }
-    char output[4096] = {0};
+    char output[kPathWidth] = {0};
     snprintf(output, sizeof(output), "%s/%s", folder.c_str(), link.c_str() + slash + 1);
 
     const char* argv[] = {
@@ -84,68 +133,35 @@ bool SmallUpdate::ExecWgetWithRetry(const std::string& link, const std::string& 
 
 bool SmallUpdate::DownloadFiles(bool& stopped) {
     int percentage = 0;
-    std::vector<std::string> links;
-
     if (m_installDebLinks.empty() && m_smallUpdateDebLink.empty() && m_flashUpdateDebLink.empty()) {
-        goto FAIL;
+        return FailDownload(percentage, m_debDir);
     }
-    unlink(kyto::kDownloadStatusFile);
-    if (!UpdateDownloadProgress(0, DOWNLOAD_STATUS_INIT)) {
-        syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
-        goto FAIL;
+    if (!StartDownload(m_debDir)) {
+        return FailDownload(percentage, m_debDir);
     }
-    // A marker left over from an earlier, already stopped download does not stop this one.
-    if ((StopRequested() && unlink(kStopMarker) != 0) || UpdateUtil::CleanFolder(m_debDir) != 1) {
-        syslog(LOG_ERR, "%s:%d Failed to cleam folder %m", kModule, __LINE__);
-        goto FAIL;
+    // A record that asks for a package without a link fails the download rather than
+    // applying half an update.
+    const Fetched fetched = FetchLinks(kyto::SmallUpdateDownloadLinks(*this), m_debDir, percentage);
+    if (fetched == Fetched::kFailed) {
+        return FailDownload(percentage, m_debDir);
     }
-
-    // The small-update package carries the configuration updater and the boot-time
-    // installer, so it is fetched only together with a configuration update or further
-    // packages.  The links are taken as the record has them: a record that asks for a
-    // package without a link fails the download rather than applying half an update.
-    links = m_installDebLinks;
-    if (m_blConfigUpdate || !m_installDebLinks.empty()) {
-        links.push_back(m_smallUpdateDebLink);
-    }
-    if (m_blFlashUpdate) {
-        links.push_back(m_flashUpdateDebLink);
-    }
-
-    for (size_t i = 0; i < links.size(); ++i) {
-        if (StopRequested()) {
-            UpdateUtil::RemoveFolder(m_debDir);
-            unlink(kStopMarker);
-            stopped = true;
-            unlink(kyto::kDownloadStatusFile);
-            return true;
-        }
-        if (!ExecWgetWithRetry(links[i], m_debDir)) {
-            goto FAIL;
-        }
-        percentage = static_cast<int>(100 * (i + 1) / links.size());
-        if (!StopRequested() && !UpdateDownloadProgress(percentage, DOWNLOAD_STATUS_DOWNLOADING)) {
-            syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
-            goto FAIL;
-        }
+    if (fetched == Fetched::kStopped) {
+        UpdateUtil::RemoveFolder(m_debDir);
+        unlink(kStopMarker);
+        stopped = true;
+        unlink(kyto::kDownloadStatusFile);
+        return true;
     }
     if (StopRequested()) {
         // Stopped after the last file: the files and the marker stay.
         stopped = true;
     } else if (!UpdateDownloadProgress(100, DOWNLOAD_STATUS_FINISHED)) {
-        syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
-        goto FAIL;
+        LogProgressFailure(__LINE__);
+        return FailDownload(percentage, m_debDir);
     }
     // From here on a finished download is recognised by the info file.
     unlink(kyto::kDownloadStatusFile);
     return true;
-
-FAIL:
-    if (!UpdateDownloadProgress(percentage, DOWNLOAD_STATUS_FAILED)) {
-        syslog(LOG_ERR, "%s:%d Failed to update download progress", kModule, __LINE__);
-    }
-    UpdateUtil::RemoveFolder(m_debDir);
-    return false;
 }
 
 bool SmallUpdate::Download(bool blDump, const std::string& folderName, bool blPassive) {
@@ -181,8 +197,8 @@ void SmallUpdate::GetDownloadStatus(int& percentage, std::string& status) {
         status = kDownloadWords[DOWNLOAD_STATUS_NONE];
         return;
     }
-    char percentBuf[16] = {0};
-    char statusBuf[16] = {0};
+    char percentBuf[kStatusNumberWidth] = {0};
+    char statusBuf[kStatusNumberWidth] = {0};
     if (KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyPercentage, percentBuf,
                              sizeof(percentBuf), 0) <= 0 ||
         KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, kyto::kKeyDownloadStatus, statusBuf,

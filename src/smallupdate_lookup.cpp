@@ -23,12 +23,13 @@
 #include "kyto_paths.h"
 #include "platform_error.h"
 #include "scoped.h"
+#include "smallupdate_internal.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
 
-namespace {
+using namespace kyto::small;
 
-constexpr const char* kModule = "smallupdate";
+namespace {
 
 // Base address of the patch lists when "small_info_path" is not configured.
 constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
@@ -59,11 +60,105 @@ class CurlEasy {
 
 // Installed small-fix number: "smallfixnumber" of the version file, 0 when it yields nothing.
 int InstalledSmallFixNumber() {
-    char buf[32] = {0};
+    char buf[kInstalledFixWidth] = {0};
     if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", buf, sizeof(buf), 0) <= 0) {
         return 0;
     }
     return static_cast<int>(strtol(buf, nullptr, 10));
+}
+
+// Fetches url into out on the handle; true on an answer 200.  A 404 fails quietly (nothing
+// is published for this build and model); any other answer is logged and sets err.
+bool PerformTransfer(CURL* curl, const std::string& url, FILE* out, int& err) {
+    // The body goes straight into the file through libcurl's default writer.  Redirects
+    // are not followed and no time-out is set: the appliance's own check waits for the
+    // server as long as the connection lives.  The error buffer only feeds the log.
+    char errorText[CURL_ERROR_SIZE] = {0};
+    curl_easy_setopt(curl, CURLOPT_URL, url.c_str());
+    curl_easy_setopt(curl, CURLOPT_WRITEDATA, out);
+    curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, errorText);
+
+    const CURLcode rc = curl_easy_perform(curl);
+    if (rc != CURLE_OK) {
+        syslog(LOG_ERR, "%s:%d failed to exec curl command", kModule, __LINE__);
+        syslog(LOG_ERR, "%s:%d %s", kModule, __LINE__,
+               errorText[0] ? errorText : curl_easy_strerror(rc));
+        return false;
+    }
+    // A failed query of the code leaves 200: the transfer itself succeeded.
+    long code = 200;
+    curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &code);
+    if (code == 200) {
+        return true;
+    }
+    if (code != 404) {
+        syslog(LOG_ERR, "%s:%d Error server %s", kModule, __LINE__, url.c_str());
+        err = SmallUpdate::ERROR_CODE_SERVER_STATUS;
+    }
+    return false;
+}
+
+// Empties every field a patch list fills; the package folder, the model and the error
+// code stay.
+void ClearListFields(SmallUpdate& u) {
+    u.m_buildNumber = -1;
+    u.m_newSmallFixNumber = -1;
+    u.m_smallUpdateDeb.clear();
+    u.m_smallUpdateDebLink.clear();
+    u.m_flashUpdateDeb.clear();
+    u.m_flashUpdateDebLink.clear();
+    u.m_blConfigUpdate = false;
+    u.m_blFlashUpdate = false;
+    u.m_blRestartAllService = false;
+    u.m_blNeedReboot = false;
+    u.m_installDebLinks.clear();
+    u.m_installDebs.clear();
+    u.m_vyxServiceRestartList.clear();
+    u.m_pkgRestartList.clear();
+}
+
+// Whether the patch list has its three members, logged when not.  A document that is not an
+// object has none of them (and jsoncpp's member lookup would throw on it).
+bool HasListMembers(const Json::Value& root) {
+    if (root.isObject() && root.isMember("smallupdate") && root.isMember("vyxversion") &&
+        root.isMember("unique")) {
+        return true;
+    }
+    syslog(LOG_ERR, "%s:%d lack of smallUpdate/vyxversion/%s in Json", kModule, __LINE__, "unique");
+    return false;
+}
+
+// Folds every entry into merger, first to last; false at the first refusal.
+bool MergeEntries(const Json::Value& entries, CustomBugFix& merger) {
+    for (Json::ArrayIndex i = 0; i < entries.size(); ++i) {
+        if (merger.Merge(entries[i]) != 1) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// Takes the merge of a list for build listBuild into the record.
+void TakeMerge(SmallUpdate& u, const CustomBugFix& merger, int listBuild) {
+    u.m_buildNumber = listBuild;
+    u.m_smallUpdateDeb = merger.m_smallUpdateDeb;
+    u.m_smallUpdateDebLink = merger.m_smallUpdateDebLink;
+    u.m_flashUpdateDeb = merger.m_flashUpdateDeb;
+    u.m_flashUpdateDebLink = merger.m_flashUpdateDebLink;
+    u.m_newSmallFixNumber = merger.m_smallFixNumber;
+    u.m_blConfigUpdate = merger.m_blConfigUpdate;
+    u.m_blFlashUpdate = merger.m_blFlashUpdate;
+    u.m_installDebLinks = merger.m_installDebLinks;
+    u.m_installDebs = merger.m_installDebs;
+    // The strongest restart demand wins: reboot, then restart of all services, then the lists.
+    if (merger.m_blNeedReboot) {
+        u.m_blNeedReboot = true;
+    } else if (merger.m_blRestartAllService) {
+        u.m_blRestartAllService = true;
+    } else {
+        u.m_vyxServiceRestartList = merger.m_vyxServiceRestartList;
+        u.m_pkgRestartList = merger.m_pkgRestartList;
+    }
 }
 
 }  // namespace
@@ -97,32 +192,7 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
         return false;
     }
 
-    // The body goes straight into the file through libcurl's default writer.  Redirects
-    // are not followed and no time-out is set: the appliance's own check waits for the
-    // server as long as the connection lives.  The error buffer only feeds the log.
-    char errorText[CURL_ERROR_SIZE] = {0};
-    curl_easy_setopt(curl.get(), CURLOPT_URL, url.c_str());
-    curl_easy_setopt(curl.get(), CURLOPT_WRITEDATA, out.get());
-    curl_easy_setopt(curl.get(), CURLOPT_ERRORBUFFER, errorText);
-
-    bool ok = false;
-    const CURLcode rc = curl_easy_perform(curl.get());
-    if (rc != CURLE_OK) {
-        syslog(LOG_ERR, "%s:%d failed to exec curl command", kModule, __LINE__);
-        syslog(LOG_ERR, "%s:%d %s", kModule, __LINE__,
-               errorText[0] ? errorText : curl_easy_strerror(rc));
-    } else {
-        // A failed query of the code leaves 200: the transfer itself succeeded.
-        long code = 200;
-        curl_easy_getinfo(curl.get(), CURLINFO_RESPONSE_CODE, &code);
-        if (code == 200) {
-            ok = true;
-        } else if (code != 404) {
-            // 404 is the ordinary answer when nothing is published for this build and model.
-            syslog(LOG_ERR, "%s:%d Error server %s", kModule, __LINE__, url.c_str());
-            m_errno = ERROR_CODE_SERVER_STATUS;
-        }
-    }
+    bool ok = PerformTransfer(curl.get(), url, out.get(), m_errno);
     // A failed close (the disk filled up while the body was written) fails the fetch too.
     if (out.close() != 0) {
         ok = false;
@@ -138,32 +208,14 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
         syslog(LOG_ERR, "%s:%d bad file name", kModule, __LINE__);
         return false;
     }
-    m_buildNumber = -1;
-    m_newSmallFixNumber = -1;
-    m_smallUpdateDeb.clear();
-    m_smallUpdateDebLink.clear();
-    m_flashUpdateDeb.clear();
-    m_flashUpdateDebLink.clear();
-    m_blConfigUpdate = false;
-    m_blFlashUpdate = false;
-    m_blRestartAllService = false;
-    m_blNeedReboot = false;
-    m_installDebLinks.clear();
-    m_installDebs.clear();
-    m_vyxServiceRestartList.clear();
-    m_pkgRestartList.clear();
+    ClearListFields(*this);
 
     Json::Value root;
     if (UpdateUtil::ParseJsonRootFromFile(path.c_str(), root) != 1) {
         syslog(LOG_ERR, "%s:%d failed to parse json file %s", kModule, __LINE__, path.c_str());
         return false;
     }
-    // A document that is not an object has none of the keys (and jsoncpp's member lookup
-    // would throw on it).
-    if (!root.isObject() || !root.isMember("smallupdate") || !root.isMember("vyxversion") ||
-        !root.isMember("unique")) {
-        syslog(LOG_ERR, "%s:%d lack of smallUpdate/vyxversion/%s in Json", kModule, __LINE__,
-               "unique");
+    if (!HasListMembers(root)) {
         return false;
     }
     const std::string listUnique = kyto::MemberText(root, "unique");
@@ -200,31 +252,11 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
     }
 
     CustomBugFix merger(installedFix);
-    for (Json::ArrayIndex i = 0; i < entries.size(); ++i) {
-        if (merger.Merge(entries[i]) != 1) {
-            return false;
-        }
+    if (!MergeEntries(entries, merger)) {
+        return false;
     }
 
-    m_buildNumber = listBuild;
-    m_smallUpdateDeb = merger.m_smallUpdateDeb;
-    m_smallUpdateDebLink = merger.m_smallUpdateDebLink;
-    m_flashUpdateDeb = merger.m_flashUpdateDeb;
-    m_flashUpdateDebLink = merger.m_flashUpdateDebLink;
-    m_newSmallFixNumber = merger.m_smallFixNumber;
-    m_blConfigUpdate = merger.m_blConfigUpdate;
-    m_blFlashUpdate = merger.m_blFlashUpdate;
-    m_installDebLinks = merger.m_installDebLinks;
-    m_installDebs = merger.m_installDebs;
-    // The strongest restart demand wins: reboot, then restart of all services, then the lists.
-    if (merger.m_blNeedReboot) {
-        m_blNeedReboot = true;
-    } else if (merger.m_blRestartAllService) {
-        m_blRestartAllService = true;
-    } else {
-        m_vyxServiceRestartList = merger.m_vyxServiceRestartList;
-        m_pkgRestartList = merger.m_pkgRestartList;
-    }
+    TakeMerge(*this, merger, listBuild);
     return true;
 }
 
@@ -265,14 +297,14 @@ bool SmallUpdate::HaveNewFix() {
 }
 
 bool SmallUpdate::CheckPatchIsSmallUpdate(const std::string& archive, bool& isSmallUpdate) {
-    char command[512] = {0};
+    char command[kArchiveCommandWidth] = {0};
     snprintf(command, sizeof(command), "/bin/tar -tf %s | /bin/grep '%s' | wc -l", archive.c_str(),
              kPatchListName);
     kyto::UniqueFile pipe(popen(command, "re"), kyto::UniqueFile::kPopen);
     if (!pipe) {
         return false;
     }
-    char line[256] = {0};
+    char line[kArchiveCountLineWidth] = {0};
     if (fgets(line, sizeof(line), pipe.get()) == nullptr) {
         return false;
     }
@@ -328,7 +360,7 @@ std::string SmallUpdate::GetFullVersion() {
         return std::string();
     }
     // The display text is cut to 63 characters, as the interface shows it.
-    char text[64] = {0};
+    char text[kFullVersionWidth] = {0};
     if (snprintf(text, sizeof(text), "VYX %s.%s-%s update %d", info.major, info.minor,
                  info.buildNum, m_newSmallFixNumber) < 0) {
         return std::string();

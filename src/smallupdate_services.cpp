@@ -4,7 +4,6 @@
 // poller through the apply status file.
 #include "smallupdate.h"
 
-#include <glob.h>
 #include <stdio.h>
 #include <syslog.h>
 
@@ -14,27 +13,18 @@
 #include <kytoplatform/klibc.h>
 #include <kytoplatform/kyto_system.h>
 
-#include "custombugfix.h"
 #include "platform_error.h"
 #include "scoped.h"
+#include "smallupdate_internal.h"
+#include "smallupdate_plan.h"
+
+using namespace kyto::small;
 
 namespace {
-
-constexpr const char* kModule = "smallupdate";
-constexpr const char* kRcDir = "/usr/kyto/etc/rc.d";
-constexpr const char* kRcPattern = "/usr/kyto/etc/rc.d/S*.sh";
-constexpr const char* kPkgCtl = "/usr/kyto/bin/kytopkg";
-constexpr const char* kInvalidRestartList = "/usr/kyto/etc.defaults/invalid_restart_service";
 
 // Platform actions of KYTOServiceOnOffALL.
 constexpr int kAllServicesStop = 1;
 constexpr int kAllServicesStart = 2;
-
-// Owns a glob result.
-struct GlobResult {
-    glob_t g{};
-    ~GlobResult() { globfree(&g); }
-};
 
 }  // namespace
 
@@ -53,31 +43,29 @@ void SmallUpdate::SwitchAllService(bool on) const {
     if (on)
         UpdateApplyProgress(0, APPLY_STAGE_START_SERVICE, "");
 
-    GlobResult scripts;
+    const std::vector<std::string> scripts = kyto::StartupScripts();
     std::vector<std::string> invalid;
-    // A read error part-way still leaves the scripts found so far; only an empty result is
-    // a listing failure.
-    glob(kRcPattern, GLOB_ERR, nullptr, &scripts.g);
-    if (scripts.g.gl_pathc == 0) {
-        syslog(LOG_ERR, "%s:%d  failed to list service under %s", kModule, __LINE__, kRcDir);
+    if (scripts.empty()) {
+        syslog(LOG_ERR, "%s:%d  failed to list service under %s", kModule, __LINE__, kyto::kRcDir);
         if (on)
-            UpdateApplyProgress(0, APPLY_STAGE_START_SERVICE, "err_system");
+            UpdateApplyProgress(0, APPLY_STAGE_START_SERVICE, kErrSystem);
     } else if (!GetInvalidRestartService(invalid)) {
         syslog(LOG_ERR, "%s:%d failed to get invalid service list", kModule, __LINE__);
         if (on)
-            UpdateApplyProgress(0, APPLY_STAGE_START_SERVICE, "err_system");
+            UpdateApplyProgress(0, APPLY_STAGE_START_SERVICE, kErrSystem);
     } else {
-        const size_t count = scripts.g.gl_pathc;
+        const size_t count = scripts.size();
         // Stopping walks the sorted list backwards so that higher-numbered services, which
-        // depend on lower-numbered ones, stop first; starting walks it forwards.
+        // depend on lower-numbered ones, stop first; starting walks it forwards.  Every
+        // script counts towards the step, skipped ones included.
         for (size_t n = 0; n < count; ++n) {
-            const char* path = scripts.g.gl_pathv[on ? n : count - 1 - n];
-            if (CustomBugFix::Find(invalid, path)) {
-                syslog(LOG_ERR, "%s:%d skip invalid service %s%s", kModule, __LINE__,
-                       path, kyto::LastErrorText().c_str());
+            const std::string& path = scripts[on ? n : count - 1 - n];
+            if (kyto::SkippedOnRestartAll(invalid, path)) {
+                syslog(LOG_ERR, "%s:%d skip invalid service %s%s", kModule, __LINE__, path.c_str(),
+                       kyto::LastErrorText().c_str());
                 continue;
             }
-            KLIBCExec(path, on ? "start" : "stop", nullptr, nullptr, nullptr);
+            KLIBCExec(path.c_str(), on ? "start" : "stop", nullptr, nullptr, nullptr);
             if (on) {
                 percentage += 100U / static_cast<unsigned int>(count);
                 UpdateApplyProgress(static_cast<int>(percentage), APPLY_STAGE_START_SERVICE, "");
@@ -94,7 +82,7 @@ void SmallUpdate::SwitchAllService(bool on) const {
 void SmallUpdate::SwitchPartialServices(bool on) const {
     const char* action = on ? "start" : "stop";
     for (const std::string& script : m_vyxServiceRestartList) {
-        const std::string path = std::string(kRcDir) + "/" + script;
+        const std::string path = std::string(kyto::kRcDir) + "/" + script;
         KLIBCExec(path.c_str(), action, nullptr, nullptr, nullptr);
     }
     for (const std::string& pkg : m_pkgRestartList)
@@ -108,16 +96,14 @@ bool SmallUpdate::GetInvalidRestartService(std::vector<std::string>& invalid) {
     kyto::UniqueFile list(fopen(kInvalidRestartList, "re"));
     if (!list)
         return false;
-    char* line = nullptr;
-    size_t capacity = 0;
+    kyto::LineBuffer line;
     ssize_t len;
-    while ((len = getline(&line, &capacity, list.get())) >= 0) {
-        std::string name(line, static_cast<size_t>(len));
+    while ((len = line.Read(list.get())) >= 0) {
+        std::string name(line.data, static_cast<size_t>(len));
         size_t end = name.find_last_not_of(" \t\f\v\n\r");
         name.erase(end == std::string::npos ? 0 : end + 1);
-        invalid.push_back(std::string(kRcDir) + "/" + name);
+        invalid.push_back(std::string(kyto::kRcDir) + "/" + name);
     }
-    free(line);
     return true;
 }
 

@@ -1,108 +1,34 @@
-// Downloading a small update with wget from the loopback server: the status file seen by a
-// poller, retries in the server's log, the stop marker from another process, the info file.
-#include <syslog.h>
-#include <unistd.h>
-
+// Downloading a small update with wget from the loopback server: status, retries, stop marker.
 #include <algorithm>
-#include <string>
-#include <vector>
 
-#include <gtest/gtest.h>
-
-#include "sandbox.h"
-#include "smallupdate.h"
-#include "update_server.h"
-
-using namespace kytotest;
+#include "engine_fixtures.h"
 
 namespace {
 
-const char* const kStatus = "/var/run/downloadVYX.status";
-const char* const kInfo = "/autoupd@te.info";
-const char* const kMarker = "/tmp/stop_download_smallfix";
+using namespace kytotest;
+const char *kStatus = "/var/run/downloadVYX.status", *kInfo = "/autoupd@te.info",
+           *kMarker = "/tmp/stop_download_smallfix";
 const std::string kDir = "/volume1//@smallupd@te_deb";
 const auto Deb = [](const std::string& name) { return SmallFixDebName(name, 5); };
 
-std::string Status() {
-    int percentage = 7;
-    std::string word;
-    SmallUpdate().GetDownloadStatus(percentage, word);
-    return std::to_string(percentage) + " " + word;
-}
+using SmallUpdateDownloadTest = SmallDownloadTest;
 
-class SmallUpdateDownloadTest : public UpdateServerTest {
-  protected:
-    void SetUp() override {
-        UpdateServerTest::SetUp();
-        u.m_newSmallFixNumber = 5;  // a filled record: the server's list is not asked
-        u.m_buildNumber = 5644;
-        u.m_blRestartAllService = true;
-    }
-    // Serves further packages of 48 KiB each, and the small-update package that comes with
-    // them (fetched last), and puts them into the record.
-    void Packages(const std::vector<std::string>& names, long bytesPerSecond = 0) {
-        std::vector<std::string> all = names;
-        all.push_back("small" + names.front());
-        for (const std::string& name : all) {
-            server->PutFileOfSize("/debs/" + Deb(name), 48 << 10);
-            if (bytesPerSecond)
-                server->SlowPath("/debs/" + Deb(name), bytesPerSecond);
-        }
-        for (const std::string& name : names) {
-            u.m_installDebs.push_back(Deb(name));
-            u.m_installDebLinks.push_back(server->Url("/debs/" + Deb(name)));
-        }
-        u.m_smallUpdateDeb = Deb(all.back());
-        u.m_smallUpdateDebLink = server->Url("/debs/" + Deb(all.back()));
-    }
-    SmallUpdate u;
-};
-
-TEST_F(SmallUpdateDownloadTest, PollerInAnotherProcessSeesEveryFileAndThenTheInfoFile) {
-    Packages({"pa", "pb"}, 192 << 10);
-    const pid_t poller = Spawn([] {
-        std::string seen, last, now;
-        for (int i = 0; i < 30000 && now != "100 finished"; ++i, usleep(2000)) {
-            now = Status();
-            if (now != "7 none" && now != last)
-                seen += (last = now) + "\n";
-        }
-        WriteFile("/tmp/polled", seen);
-        return 0;
-    });
-    ASSERT_TRUE(u.Download(true));
-    EXPECT_EQ(0, Wait(poller));
-    // Between two key writes a poller may see a mixed pair; the steady states must all show.
-    const std::string polled = ReadFile("/tmp/polled").value_or("");
-    size_t at = 0;
-    for (const char* state :
-         {"0 init\n", "33 downloading\n", "66 downloading\n", "100 finished\n"}) {
-        at = polled.find(state, at);
-        ASSERT_NE(std::string::npos, at) << state << " missing in order from\n" << polled;
-    }
-    EXPECT_EQ((std::vector<std::string>{Deb("pa"), Deb("pb"), Deb("smallpa")}), ListDir(kDir));
-    EXPECT_FALSE(PathExists(kStatus)) << "a finished download is told by the info file";
-}
-
+// Seven files: the first arrives at its fourth try, the fifth never; the status keeps the
+// percentage of the last completed file, 4 of 7.
 TEST_F(SmallUpdateDownloadTest, RetriesAreCountedAndTheTenthFailureEndsTheDownload) {
-    Packages({"ra", "rb"});
+    Packages({"ra", "r2", "r3", "r4", "rb", "r6"});
     server->FailPath("/debs/" + Deb("ra"), 500, 3);
     server->FailPath("/debs/" + Deb("rb"), 503);
-    ClearSyslog();
     EXPECT_FALSE(u.Download(true));
     EXPECT_EQ(4u, server->RequestsFor("/debs/" + Deb("ra")).size());
     EXPECT_EQ(10u, server->RequestsFor("/debs/" + Deb("rb")).size());
-    EXPECT_TRUE(server->RequestsFor("/debs/" + Deb("smallra")).empty());
-    EXPECT_EQ("33 failed", Status()) << "the percentage of the last completed file";
-    EXPECT_FALSE(PathExists(kDir) || PathExists(kInfo));
-    EXPECT_TRUE(SyslogContains("failed to exec cmd=[/usr/kyto/bin/wget " + u.m_installDebLinks[1] +
+    EXPECT_TRUE(server->RequestsFor("/debs/" + Deb("r6")).empty());
+    EXPECT_EQ("57 failed", SmallDownloadSeen());
+    EXPECT_TRUE(SyslogContains("failed to exec cmd=[/usr/kyto/bin/wget " + u.m_installDebLinks[4] +
                                    " -O " + kDir + "/" + Deb("rb") +
                                    " --timeout=15 --tries=1], r=8",
                                LOG_ERR));
-
-    // A link without a folder is refused before wget runs, ten times.
-    ClearSyslog();
-    EXPECT_FALSE(SmallUpdate::ExecWgetWithRetry("nolink.deb", "/tmp"));
+    EXPECT_FALSE(SmallUpdate::ExecWgetWithRetry("nolink.deb", "/tmp"));  // no folder: ten refusals
     const std::vector<std::string> logged = SyslogMessages(LOG_ERR);
     EXPECT_EQ(10, std::count_if(logged.begin(), logged.end(), [](const std::string& m) {
                   return m.find("Wrong download link [nolink.deb]") != std::string::npos;
@@ -110,37 +36,37 @@ TEST_F(SmallUpdateDownloadTest, RetriesAreCountedAndTheTenthFailureEndsTheDownlo
 }
 
 // The stop marker: left over before the download, created by a cancel in another process
-// while the first of three files is on its way, or while the last one is.
+// while the first of three files is on its way, or while the last one is; a finished
+// download is told by the info file alone.
 TEST_F(SmallUpdateDownloadTest, StopMarkerBeforeBetweenAndAfterFiles) {
     enum When { kBefore, kBetween, kAfter };
     for (When when : {kBefore, kBetween, kAfter}) {
         SCOPED_TRACE(when);
         server->ClearRequests();
-        u.m_installDebs.clear();
-        u.m_installDebLinks.clear();
         const std::string tag = std::to_string(when);
         Packages({"a" + tag, "b" + tag}, when == kBefore ? 0 : 96 << 10);
         if (when == kBefore)
             WriteFile(kMarker, "");
         const std::string first =
             kDir + "/" + (when == kAfter ? u.m_smallUpdateDeb : u.m_installDebs[0]);
+        // A poller sees each finished file: two of three when the last one is on its way.
         const pid_t canceller = Spawn([&] {
-            return when == kBefore || (WaitFor([&] { return PathExists(first); }) &&
-                                       SmallUpdate().CancelDownload())
+            return when == kBefore ||
+                           (WaitFor([&] { return PathExists(first); }) &&
+                            (when != kAfter || SmallDownloadSeen() == "66 downloading") &&
+                            SmallUpdate().CancelDownload())
                        ? 0
                        : 1;
         });
         EXPECT_TRUE(u.Download(true));
         EXPECT_EQ(0, Wait(canceller));
-        EXPECT_FALSE(PathExists(kStatus));
-        EXPECT_EQ(when == kBefore, PathExists(kInfo));
+        EXPECT_EQ(when == kBefore ? "100 finished" : "7 none", SmallDownloadSeen());
         EXPECT_EQ(when == kAfter, PathExists(kMarker));
         EXPECT_EQ(when == kBetween ? 1u : 3u, server->Requests().size());
         EXPECT_EQ(when == kBetween ? 0u : 3u, ListDir(kDir).size());
         Shell("rm -f /tmp/stop_download_smallfix /autoupd@te.info");
     }
-    // The marker is an empty file, also where an old one had content.
-    WriteFile(kMarker, "left by something else");
+    WriteFile(kMarker, "left by something else");  // a cancel leaves it empty
     EXPECT_TRUE(SmallUpdate().CancelDownload());
     EXPECT_EQ("", ReadFile(kMarker).value_or("missing"));
 }
@@ -152,7 +78,7 @@ TEST_F(SmallUpdateDownloadTest, WhatIsFetchedAndWhatCountsAsDownloaded) {
     WriteFile(kStatus, "updateType=smallupdate\npercentage=\"0\"\ndownloadStatus=\"4\"\n");
     ASSERT_TRUE(u.Download(true));
     EXPECT_TRUE(server->Requests().empty());
-    EXPECT_EQ("100 finished", Status());
+    EXPECT_EQ("100 finished", SmallDownloadSeen());
 
     // With a configuration update it is; a flash package only with its flag.
     u.m_blConfigUpdate = u.m_blFlashUpdate = true;
@@ -160,7 +86,7 @@ TEST_F(SmallUpdateDownloadTest, WhatIsFetchedAndWhatCountsAsDownloaded) {
     u.m_flashUpdateDebLink = server->Url("/debs/" + Deb("flash"));
     server->PutFile("/debs/" + Deb("small"), "s");
     server->PutFile("/debs/" + Deb("flash"), "f");
-    u.m_installDebs = {Deb("absent")};
+    u.m_installDebs = {Deb("absent"), Deb("after")};
     ASSERT_TRUE(u.Download(true));
     EXPECT_EQ((std::vector<std::string>{Deb("flash"), Deb("small")}), ListDir(kDir));
     EXPECT_TRUE(SmallUpdate().IsReadyApply()) << "the flash package is enough";
@@ -168,13 +94,15 @@ TEST_F(SmallUpdateDownloadTest, WhatIsFetchedAndWhatCountsAsDownloaded) {
     EXPECT_TRUE(SmallUpdate().IsReadyApply()) << "so is the small-update package";
     RemoveTree(kDir + "/" + Deb("small"));
     EXPECT_FALSE(SmallUpdate().IsReadyApply());
+    EXPECT_TRUE(SyslogContains("can't access [" + kDir + "/" + Deb("absent") + "]", LOG_ERR) &&
+                !SyslogContains(Deb("after")));  // the check stops at the first missing file
 
     // Without an info file the status file tells; a state beyond the table is a failure.
     RemoveTree(kInfo);
     WriteFile(kStatus, "percentage=\"42\"\ndownloadStatus=\"-1\"\n");
-    EXPECT_EQ("42 failed", Status());
+    EXPECT_EQ("42 failed", SmallDownloadSeen());
     RemoveTree(kStatus);
-    EXPECT_EQ("7 none", Status());
+    EXPECT_EQ("7 none", SmallDownloadSeen());
 }
 
 }  // namespace

@@ -151,6 +151,66 @@ SmallUpdate DumpableRecord() {
     return u;
 }
 
+std::string SmallDownloadSeen() {
+    int percentage = 7;
+    std::string word;
+    SmallUpdate().GetDownloadStatus(percentage, word);
+    return std::to_string(percentage) + " " + word;
+}
+
+void SmallDownloadTest::SetUp() {
+    UpdateServerTest::SetUp();
+    u.m_newSmallFixNumber = 5;  // a filled record: the server's list is not asked
+    u.m_buildNumber = 5644;
+    u.m_blRestartAllService = true;
+}
+
+void SmallDownloadTest::Packages(const std::vector<std::string>& names, long bytesPerSecond) {
+    u.m_installDebs.clear();
+    u.m_installDebLinks.clear();
+    std::vector<std::string> all = names;
+    all.push_back("small" + names.front());
+    for (const std::string& name : all) {
+        const std::string deb = SmallFixDebName(name, 5), link = server->Url("/debs/" + deb);
+        server->PutFileOfSize("/debs/" + deb, 48 << 10);
+        if (bytesPerSecond)
+            server->SlowPath("/debs/" + deb, bytesPerSecond);
+        (name == all.back() ? u.m_smallUpdateDeb : u.m_installDebs.emplace_back()) = deb;
+        (name == all.back() ? u.m_smallUpdateDebLink : u.m_installDebLinks.emplace_back()) = link;
+    }
+}
+
+PatchEntry PatchListTest::Entry(int fix, const std::string& restart) {
+    const std::string pkg = "fix" + std::to_string(fix);
+    return {fix,
+            {{"smallupdate", server->Url("/debs/" + SmallFixDebName("smallfix", fix))},
+             {pkg, server->Url("/debs/" + SmallFixDebName(pkg, fix))}},
+            false,
+            false,
+            restart};
+}
+
+std::vector<PatchEntry> PatchListTest::RealisticList() {
+    std::vector<PatchEntry> list = {Entry(1, "\"reboot\""), Entry(2), Entry(5), Entry(4)};
+    list[2].flash = true;
+    list[2].restart = "{\"vyx_service\":[\"samba\",\"sshd\"],\"pkg\":[\"web\"]}";
+    list[2].proj.push_back({"flashupdate", server->Url("/debs/" + SmallFixDebName("flash", 5))});
+    list[3].config = true;
+    list[3].restart = "{\"vyx_service\":[\"samba\"],\"pkg\":[]}";
+    return list;
+}
+
+void InstallServiceProbes(const std::vector<std::string>& scripts) {
+    const std::string probe =
+        "#!/bin/sh\nf=/var/run/applySmallUpd@te.status\ns=none\n"
+        "[ -f \"$f\" ] && s=$(. \"$f\"; echo \"$percentage/$stage\")\n"
+        "printf '%s\\t%s\\t%s\\n' \"${0##*/}\" \"$*\" \"$s\" >>/var/log/kyto-calls.log\n";
+    RemoveTree("/usr/kyto/etc/rc.d");
+    for (const std::string& s : scripts)
+        WriteFile("/usr/kyto/etc/rc.d/" + s, probe, 0755);
+    WriteFile("/usr/kyto/bin/kytopkg", probe, 0755);
+}
+
 const std::string kPatchBase = "http://updates.example.invalid/smallupdate/5644/";
 
 std::string FixDeb(const std::string& package, int fix) {

@@ -96,6 +96,34 @@ void WriteSmallInfo(const std::vector<std::pair<std::string, const char*>>& chan
 // package folder "/volume1/d".
 SmallUpdate DumpableRecord();
 
+// GetDownloadStatus of the small update as a fresh record in this process sees it:
+// "<percentage> <word>", the percentage starting from the caller's 7.
+std::string SmallDownloadSeen();
+// A record for build 5644, fix 5, restart of all services, whose download runs against the
+// loopback server into "/volume1//@smallupd@te_deb".
+class SmallDownloadTest : public UpdateServerTest {
+  protected:
+    void SetUp() override;
+    // Serves further packages of 48 KiB each (at bytesPerSecond when given) and the
+    // small-update package that comes with them ("small" + the first name, fetched last),
+    // and puts them into the record in place of earlier ones.
+    void Packages(const std::vector<std::string>& names, long bytesPerSecond = 0);
+    SmallUpdate u;
+};
+// The patch-list lookup against the loopback server.
+class PatchListTest : public UpdateServerTest {
+  protected:
+    // Fix `fix`: its small-update package "smallfix" and one further package "fix<fix>".
+    PatchEntry Entry(int fix, const std::string& restart = "\"none\"");
+    // Fixes 1 (reboot) and 2, then a flash fix 5 (restarting samba, sshd and the add-on
+    // web) and a configuration fix 4 (restarting samba): out of ascending order.
+    std::vector<PatchEntry> RealisticList();
+};
+// Replaces the provisioned start-up scripts and the package control program with probes
+// that record their arguments and the apply status ("percentage/stage", or "none") a
+// poller would have read at the moment they ran.
+void InstallServiceProbes(const std::vector<std::string>& scripts);
+
 // ---- Patch-list entries as JSON ----------------------------------------------------------
 
 // Where the entries' packages are "served": "http://updates.example.invalid/smallupdate/5644/".
