@@ -22,6 +22,7 @@
 #include "kyto_paths.h"
 #include "platform_error.h"
 #include "smallupdate_internal.h"
+#include "version_file.h"
 #include "update_cpputil.h"
 
 using kyto::small::kModule;
@@ -92,12 +93,8 @@ bool InfoDocumentIsComplete(const Json::Value& info) {
 // Whether the info file was made for the build this system runs; false also when the
 // running build cannot be read.
 bool InfoBuildIsRunning(const Json::Value& info) {
-    char buildNumber[16] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buildNumber, sizeof(buildNumber),
-                             0) < 0) {
-        return false;
-    }
-    return strtol(buildNumber, nullptr, 10) == info["buildnumber"].asInt();
+    const kyto::VersionKey<16> build("buildnumber");
+    return build.result >= 0 && strtol(build.text, nullptr, 10) == info["buildnumber"].asInt();
 }
 
 // Package names as the package tool's wrapper reads them: every one must carry a small-fix

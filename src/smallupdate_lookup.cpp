@@ -24,6 +24,7 @@
 #include "platform_error.h"
 #include "scoped.h"
 #include "smallupdate_internal.h"
+#include "version_file.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
 
@@ -170,15 +171,14 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
         m_errno = ERROR_CODE_BAD_INPUT;
         return false;
     }
-    char buildNumber[64] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buildNumber, sizeof(buildNumber),
-                             0) < 0) {
+    const kyto::VersionKey<64> build("buildnumber");
+    if (build.result < 0) {
         syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
                kyto::LastErrorText().c_str());
         m_errno = ERROR_CODE_BAD_INPUT;
         return false;
     }
-    const std::string url = base + "/" + buildNumber + "/" + m_unique + "/" + kPatchListName;
+    const std::string url = base + "/" + build.text + "/" + m_unique + "/" + kPatchListName;
 
     InitCurlOnce();
     CurlEasy curl;
@@ -226,13 +226,13 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
         return false;
     }
 
-    char buf[32] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "buildnumber", buf, sizeof(buf), 0) < 0) {
+    const kyto::VersionKey<32> build("buildnumber");
+    if (build.result < 0) {
         syslog(LOG_ERR, "%s:%d Get buildnumber Fail%s", kModule, __LINE__,
                kyto::LastErrorText().c_str());
         return false;
     }
-    const int runningBuild = static_cast<int>(strtol(buf, nullptr, 10));
+    const int runningBuild = static_cast<int>(strtol(build.text, nullptr, 10));
     const int installedFix = InstalledSmallFixNumber();
 
     const Json::Value& entries = root["smallupdate"];
