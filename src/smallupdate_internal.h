@@ -52,25 +52,27 @@ constexpr const char* kErrSystem = "err_system";
 
 // ---- Field widths: the fixed buffers each read or formatted text uses ----
 
-// A number of a status file (percentage, download state, apply stage), read or written.
-constexpr size_t kStatusNumberWidth = 16;
-// The apply status file's ErrMsg as the reader takes it.
-constexpr size_t kErrMsgWidth = 256;
-// The temporary file's path next to the apply status file.
-constexpr size_t kStatusTempPathWidth = 128;
-// "smallfixnumber" as the lookup compares it with the record's fix.
-constexpr size_t kInstalledFixWidth = 32;
-// "smallfixnumber" as the apply logs the installed one and writes the new one.
-constexpr size_t kApplyFixWidth = 8;
-// "debDir" of the passive marker file, read by the apply's clean-up.
-constexpr size_t kPassiveDirWidth = 4095;
-// The shell command that counts the patch lists in an archive, and its one output line.
-constexpr size_t kArchiveCommandWidth = 512;
-constexpr size_t kArchiveCountLineWidth = 256;
-// The display name "VYX <major>.<minor>-<build> update <fix>" (63 characters shown).
-constexpr size_t kFullVersionWidth = 64;
-// A path of the file system: wget's output file, the caller's working folder.
-constexpr size_t kPathWidth = 4096;
+enum FieldWidth : size_t {
+    // A number of a status file (percentage, download state, apply stage), read or written.
+    kStatusNumberWidth = 16,
+    // The apply status file's ErrMsg as the reader takes it.
+    kErrMsgWidth = 256,
+    // The temporary file's path next to the apply status file.
+    kStatusTempPathWidth = 128,
+    // "smallfixnumber" as the lookup compares it with the record's fix.
+    kInstalledFixWidth = 32,
+    // "smallfixnumber" as the apply logs the installed one and writes the new one.
+    kApplyFixWidth = 8,
+    // "debDir" of the passive marker file, read by the apply's clean-up.
+    kPassiveDirWidth = 4095,
+    // The shell command that counts the patch lists in an archive, and its one output line.
+    kArchiveCommandWidth = 512,
+    kArchiveCountLineWidth = 256,
+    // The display name "VYX <major>.<minor>-<build> update <fix>" (63 characters shown).
+    kFullVersionWidth = 64,
+    // A path of the file system: wget's output file, the caller's working folder.
+    kPathWidth = 4096,
+};
 
 // ---- Words given to the interface's poller ----
 

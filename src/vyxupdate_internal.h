@@ -8,6 +8,8 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include <initializer_list>
+
 #include "vyxupdate.h"
 
 namespace kyto {
@@ -81,6 +83,21 @@ inline long ToNumber(const char* text) {
 inline void ClearRecord(_tag_vyxinfo_& info) {
     memset(&info, 0, sizeof(info));
 }
+
+// One key of a key=value file to read into a fixed buffer; reported is the key that a
+// failure's message names.
+struct KeyRead {
+    const char* file;
+    const char* key;
+    const char* reported;
+    char* buf;
+    int size;
+};
+
+// Reads the keys in order and stops at the first one the reader does not find (a result
+// below 1), logged as "Fail to get [reported] from [file]" with the platform's last error.
+// True when every key was read.
+bool ReadKeys(std::initializer_list<KeyRead> reads);
 
 }  // namespace vyx
 }  // namespace kyto

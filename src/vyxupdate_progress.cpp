@@ -193,28 +193,17 @@ int VyxUpdate::ReadStatusFileKeys(StatusFileKeys& keys) {
 
     // Log readers know the messages for a missing "downloadCount" and "downloadNum" by the
     // key named before each of them.
-    struct KeyRead {
-        const char* key;
-        const char* reported;
-        char* buf;
-        int size;
-    };
-    const KeyRead reads[] = {
-        {kyto::kKeyPatchPath, kyto::kKeyPatchPath, keys.patchPath, sizeof(keys.patchPath)},
-        {kyto::kKeyDownloadStatus, kyto::kKeyDownloadStatus, keys.downloadStatus,
+    const bool read = ReadKeys({
+        {file, kyto::kKeyPatchPath, kyto::kKeyPatchPath, keys.patchPath, sizeof(keys.patchPath)},
+        {file, kyto::kKeyDownloadStatus, kyto::kKeyDownloadStatus, keys.downloadStatus,
          sizeof(keys.downloadStatus)},
-        {kyto::kKeyDownloadCount, kyto::kKeyPatchPath, keys.downloadCount,
+        {file, kyto::kKeyDownloadCount, kyto::kKeyPatchPath, keys.downloadCount,
          sizeof(keys.downloadCount)},
-        {kyto::kKeyDownloadNum, kyto::kKeyDownloadStatus, keys.downloadNum,
+        {file, kyto::kKeyDownloadNum, kyto::kKeyDownloadStatus, keys.downloadNum,
          sizeof(keys.downloadNum)},
-    };
-    for (const KeyRead& r : reads) {
-        if (KLIBCFileGetKeyValue(file, r.key, r.buf, r.size, 0) < 1) {
-            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, r.reported,
-                   file, kyto::LastErrorText().c_str());
-            return -1;
-        }
-    }
+    });
+    if (!read)
+        return -1;
     return 1;
 }
 

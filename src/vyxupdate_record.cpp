@@ -14,29 +14,29 @@
 
 using namespace kyto::vyx;
 
-int VyxUpdate::GetVyxInfo(_tag_vyxinfo_& info) {
-    struct Source {
-        const char* file;
-        const char* key;
-        char* field;
-        int size;
-    };
-    const Source sources[] = {
-        {kyto::kVersionFile, "majorversion", info.major, sizeof(info.major)},
-        {kyto::kVersionFile, "minorversion", info.minor, sizeof(info.minor)},
-        {kyto::kVersionFile, "buildphase", info.buildPhase, sizeof(info.buildPhase)},
-        {kyto::kVersionFile, "buildnumber", info.buildNum, sizeof(info.buildNum)},
-        {kyto::kVersionFile, "builddate", info.buildDate, sizeof(info.buildDate)},
-        {kyto::kInfoConfFile, "unique", info.unique, sizeof(info.unique)},
-    };
-    for (const Source& src : sources) {
-        if (KLIBCFileGetKeyValue(src.file, src.key, src.field, src.size, 0) < 1) {
-            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, src.key,
-                   src.file, kyto::LastErrorText().c_str());
-            return 0;
+bool kyto::vyx::ReadKeys(std::initializer_list<KeyRead> reads) {
+    for (const KeyRead& r : reads) {
+        if (KLIBCFileGetKeyValue(r.file, r.key, r.buf, r.size, 0) < 1) {
+            syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, r.reported,
+                   r.file, kyto::LastErrorText().c_str());
+            return false;
         }
     }
-    return 1;
+    return true;
+}
+
+int VyxUpdate::GetVyxInfo(_tag_vyxinfo_& info) {
+    const char* version = kyto::kVersionFile;
+    return ReadKeys({
+               {version, "majorversion", "majorversion", info.major, sizeof(info.major)},
+               {version, "minorversion", "minorversion", info.minor, sizeof(info.minor)},
+               {version, "buildphase", "buildphase", info.buildPhase, sizeof(info.buildPhase)},
+               {version, "buildnumber", "buildnumber", info.buildNum, sizeof(info.buildNum)},
+               {version, "builddate", "builddate", info.buildDate, sizeof(info.buildDate)},
+               {kyto::kInfoConfFile, "unique", "unique", info.unique, sizeof(info.unique)},
+           })
+               ? 1
+               : 0;
 }
 
 void VyxUpdate::SetVyxInfo(const _tag_rss_tag_type_& type, const char* value, _tag_vyxinfo_& info) {
