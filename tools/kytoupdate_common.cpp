@@ -3,6 +3,8 @@
 #include <stdio.h>
 #include <time.h>
 
+#include <iterator>
+
 #include "update_cpputil.h"
 
 namespace kytoupdate {
@@ -57,24 +59,21 @@ std::string KindWord(int patchType) {
 }
 
 std::string SmallErrnoText(int errorCode) {
-    switch (errorCode) {
-        case SmallUpdate::ERROR_CODE_SERVER_STATUS:
-            return "the update server answered with an error";
-        case SmallUpdate::ERROR_CODE_NO_ROOM:
-            return "no volume has room for the download";
-        case SmallUpdate::ERROR_CODE_BAD_INPUT:
-            return "bad or unreadable update information";
-        case SmallUpdate::ERROR_CODE_BUILD_MISMATCH:
-            return "the update was made for another build";
-        case SmallUpdate::ERROR_CODE_BAD_FIX_NUMBER:
-            return "bad small-fix number, or a patch list for another build";
-        case SmallUpdate::ERROR_CODE_DOWNGRADE:
-            return "the update is older than the installed small fix";
-        case SmallUpdate::ERROR_CODE_OTHER_MODEL:
-            return "the patch list is for another device model";
-        default:
-            return "no small update";
-    }
+    // Indexed by SmallUpdate::ERROR_CODE.
+    static const char* const kTexts[] = {
+        "no small update",
+        "the update server answered with an error",
+        "no volume has room for the download",
+        "bad or unreadable update information",
+        "the update was made for another build",
+        "bad small-fix number, or a patch list for another build",
+        "the update is older than the installed small fix",
+        "the patch list is for another device model",
+    };
+    static_assert(std::size(kTexts) == SmallUpdate::ERROR_CODE_OTHER_MODEL + 1,
+                  "one text per error code");
+    return errorCode > 0 && errorCode < static_cast<int>(std::size(kTexts)) ? kTexts[errorCode]
+                                                                            : kTexts[0];
 }
 
 }  // namespace kytoupdate

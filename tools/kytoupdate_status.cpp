@@ -3,7 +3,9 @@
 #include <stdio.h>
 #include <stdlib.h>
 
+#include <initializer_list>
 #include <sstream>
+#include <utility>
 
 #include <kytoplatform/klibc.h>
 
@@ -59,24 +61,32 @@ StatusSnapshot TakeSnapshot() {
     return s;
 }
 
+namespace {
+
+// An object of the given members, in the given order.
+Json::Value Object(std::initializer_list<std::pair<const char*, Json::Value>> members) {
+    Json::Value object(Json::objectValue);
+    for (const auto& [key, value] : members)
+        object[key] = value;
+    return object;
+}
+
+}  // namespace
+
 Json::Value ToJson(const StatusSnapshot& s) {
-    Json::Value root(Json::objectValue);
-    root["downloading"] = s.downloading;
-    root["downloaded"] = s.downloaded;
-    Json::Value& vyx = root["vyxupdate"];
-    vyx["status"] = s.vyxStatus;
-    vyx["percentage"] = s.vyxPercentage;
-    vyx["image"] = s.image;
-    vyx["images"] = s.images;
-    vyx["path"] = s.imagePath;
-    Json::Value& small = root["smallupdate"];
-    small["status"] = s.smallStatus;
-    small["percentage"] = s.smallPercentage;
-    Json::Value& apply = root["apply"];
-    apply["stage"] = s.applyStage;
-    apply["percentage"] = s.applyPercentage;
-    apply["error"] = s.applyError;
-    return root;
+    return Object({
+        {"downloading", s.downloading},
+        {"downloaded", s.downloaded},
+        {"vyxupdate", Object({{"status", s.vyxStatus},
+                              {"percentage", s.vyxPercentage},
+                              {"image", s.image},
+                              {"images", s.images},
+                              {"path", s.imagePath}})},
+        {"smallupdate", Object({{"status", s.smallStatus}, {"percentage", s.smallPercentage}})},
+        {"apply", Object({{"stage", s.applyStage},
+                          {"percentage", s.applyPercentage},
+                          {"error", s.applyError}})},
+    });
 }
 
 std::string ToText(const StatusSnapshot& s) {

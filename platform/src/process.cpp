@@ -201,11 +201,10 @@ int KLIBCKill(const char* pidFile, int blForce) noexcept try {
     int pid = PidFromFile(pidFile);
     if (pid < 0)
         return -1;
-    if (::kill(pid, blForce ? SIGKILL : SIGTERM) != 0) {
-        KYTO_FAIL(KYTO_ERR_PROCESS);
-        return -1;
-    }
-    return 0;
+    if (::kill(pid, blForce ? SIGKILL : SIGTERM) == 0)
+        return 0;
+    KYTO_FAIL(KYTO_ERR_PROCESS);
+    return -1;
 } catch (...) {
     return KYTO_FAIL_ON_EXCEPTION(-1);
 }
