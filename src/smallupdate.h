@@ -38,13 +38,13 @@ class KYTO_EXPORT SmallUpdate {
     // Reason of the last failure, kept in m_errno and read by GetErrno.
     enum ERROR_CODE {
         ERROR_CODE_NONE = 0,
-        ERROR_CODE_SERVER_STATUS = 1,    // the server answered neither 200 nor 404
-        ERROR_CODE_NO_ROOM = 2,          // no volume has room for the download
-        ERROR_CODE_BAD_INPUT = 3,        // bad argument, unreadable build, invalid info file
-        ERROR_CODE_BUILD_MISMATCH = 4,   // the info file is for another build (or unchecked)
-        ERROR_CODE_BAD_FIX_NUMBER = 5,   // small-fix number below 1, or a list for another build
-        ERROR_CODE_DOWNGRADE = 6,        // older than the small fix already installed
-        ERROR_CODE_OTHER_MODEL = 7,      // the patch list is for another device model
+        ERROR_CODE_SERVER_STATUS = 1,   // the server answered neither 200 nor 404
+        ERROR_CODE_NO_ROOM = 2,         // no volume has room for the download
+        ERROR_CODE_BAD_INPUT = 3,       // bad argument, unreadable build, invalid info file
+        ERROR_CODE_BUILD_MISMATCH = 4,  // the info file is for another build (or unchecked)
+        ERROR_CODE_BAD_FIX_NUMBER = 5,  // small-fix number below 1, or a list for another build
+        ERROR_CODE_DOWNGRADE = 6,       // older than the small fix already installed
+        ERROR_CODE_OTHER_MODEL = 7,     // the patch list is for another device model
     };
 
     SmallUpdate();

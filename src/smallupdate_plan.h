@@ -46,7 +46,8 @@ inline std::vector<std::string> StartupScripts() {
 
 // Whether a restart of all services leaves script alone: it is on the invalid-restart
 // list (whole paths compared).
-inline bool SkippedOnRestartAll(const std::vector<std::string>& invalid, const std::string& script) {
+inline bool SkippedOnRestartAll(const std::vector<std::string>& invalid,
+                                const std::string& script) {
     return CustomBugFix::Find(invalid, script) != 0;
 }
 

@@ -121,7 +121,8 @@ int WaitProgram(pid_t pid) {
 
 extern "C" {
 
-int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4) noexcept try {
+int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3,
+              const char* a4) noexcept try {
     if (prog == nullptr || *prog == '\0') {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;

@@ -179,7 +179,8 @@ void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node) noexcept {
     }
 }
 
-int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count) noexcept try {
+int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count) noexcept
+    try {
     if (flags != 0 || out == nullptr || count < 1) {
         KYTO_FAIL(KYTO_ERR_BAD_PARAMETER);
         return -1;

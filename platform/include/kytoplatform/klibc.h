@@ -52,7 +52,8 @@ int KLIBCErrLogSet(const char* logPath, const char* text) KYTO_NOEXCEPT;
  * 0), 0 when the key is absent, -1 when the file cannot be read or an argument is bad
  * (NULL pointer, empty key, size < 1, flags != 0).  On -1 buf is left untouched; when the
  * key is absent buf holds "".  With size 1 nothing fits: buf is "" and the result 0. */
-int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size, int flags) KYTO_NOEXCEPT;
+int KLIBCFileGetKeyValue(const char* path, const char* key, char* buf, int size,
+                         int flags) KYTO_NOEXCEPT;
 /* Replaces the first line for key in place (or appends one), keeping every other line and
  * their order; creates the file (0644) when missing.  lineFormat is a printf format with
  * exactly two %s (key, value); NULL means "%s=\"%s\"\n".  The content is written to a
@@ -78,7 +79,8 @@ int KLIBCFileExist(const char* path) KYTO_NOEXCEPT;
  * is close-on-exec).  Returns the exit status 0..255; -1 when it cannot fork or wait, or
  * the child died by a signal (KYTO_ERR_EXEC).  A program that cannot be executed exits
  * with 127, and the last error is then KYTO_ERR_EXEC. */
-int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3, const char* a4) KYTO_NOEXCEPT;
+int KLIBCExec(const char* prog, const char* a1, const char* a2, const char* a3,
+              const char* a4) KYTO_NOEXCEPT;
 /* The same with a NULL-terminated argv (argv[0] included).  With blWait 0 the child's pid
  * is returned without waiting (the caller reaps it). */
 int KLIBCExecv(const char* prog, char* const argv[], int blWait) KYTO_NOEXCEPT;

@@ -55,7 +55,8 @@ void KYTOMountVolInfoFree(PKYTO_MOUNT_VOL_INFO node) KYTO_NOEXCEPT;
 /* Fills out[0] with the first writable data volume whose free bytes are greater than
  * minFree.  count is the number of entries out can hold (at least 1).  1 found, 0 none
  * (no data volume at all is "none", not an error), -1 error. */
-int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out, int count) KYTO_NOEXCEPT;
+int VolumeAvailGet(int flags, unsigned long long minFree, PKYTO_VOLUME_INFO out,
+                   int count) KYTO_NOEXCEPT;
 /* Creates the folder and its missing parents with mode; 0 ok (also when it already exists
  * as a folder), -1 error. */
 int KYTOFSMkdirP(const char* path, mode_t mode) KYTO_NOEXCEPT;
