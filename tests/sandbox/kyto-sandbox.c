@@ -148,8 +148,8 @@ static void MakeDirs(const char* path) {
 static unsigned long KeptMountFlags(const char* path) {
     static const struct {
         unsigned long st, ms;
-    } kFlags[] = {{ST_NOSUID, MS_NOSUID},     {ST_NODEV, MS_NODEV},
-                  {ST_NOEXEC, MS_NOEXEC},     {ST_NOATIME, MS_NOATIME},
+    } kFlags[] = {{ST_NOSUID, MS_NOSUID},         {ST_NODEV, MS_NODEV},
+                  {ST_NOEXEC, MS_NOEXEC},         {ST_NOATIME, MS_NOATIME},
                   {ST_NODIRATIME, MS_NODIRATIME}, {ST_RELATIME, MS_RELATIME}};
     struct statvfs vfs;
     unsigned long flags = 0;

@@ -172,8 +172,7 @@ DebPackage FailingDeb(const std::string& package, const std::string& version) {
 
 bool DpkgInstalled(const std::string& package) {
     std::string out;
-    return RunCommand("dpkg-query -W -f='${Status}' " + ShellQuote(package),
-                      &out) == 0 &&
+    return RunCommand("dpkg-query -W -f='${Status}' " + ShellQuote(package), &out) == 0 &&
            out == "install ok installed";
 }
 
