@@ -76,6 +76,12 @@ else
     cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_SANITIZE=OFF \
         -DKYTO_BUILD_TESTS=ON -DKYTO_WERROR=ON >/dev/null
 fi
+if [ $SANITIZE -eq 0 ] && git -C "$ROOT" rev-parse --git-dir >/dev/null 2>&1; then
+    # Every C and C++ file as .clang-format lays it out (clang-format -i FILE mends one).
+    step "clang-format check"
+    git -C "$ROOT" ls-files -z '*.c' '*.cpp' '*.h' | xargs -0 clang-format --dry-run -Werror
+fi
+
 step "build (-j$JOBS)"
 cmake --build "$BUILD" -j"$JOBS"
 
