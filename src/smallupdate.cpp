@@ -221,7 +221,7 @@ bool SmallUpdate::InfoFileTarget(bool blPassive, std::string& target) const {
     target = m_debDir + kyto::kAutoUpdateInfoFile;
     unlink(kyto::kPassiveInfoFile);
     if (KLIBCFileSetKeyValue(kyto::kPassiveInfoFile, "debDir", m_debDir.c_str(), nullptr) < 1) {
-        // The message's last conversion is a number where the marker file is meant; the
+        // KEPT: the message's last conversion is a number where the marker file is meant; the
         // log readers expect this form.  Passing the char* itself to %d would be
         // undefined, so the pointer value is passed as an int.
         syslog(LOG_ERR, "%s:%d failed to set debDri=%s into %d", kModule, __LINE__,

@@ -58,6 +58,7 @@ bool StartDownload(const std::string& debDir) {
     }
     // A marker left over from an earlier, already stopped download does not stop this one.
     if ((StopRequested() && unlink(kStopMarker) != 0) || UpdateUtil::CleanFolder(debDir) != 1) {
+        // KEPT: "cleam" is the text log readers search for.
         syslog(LOG_ERR, "%s:%d Failed to cleam folder %m", kModule, __LINE__);
         return false;
     }

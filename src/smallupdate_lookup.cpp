@@ -246,6 +246,7 @@ bool SmallUpdate::SetUpdateList(const std::string& path) {
     const int listBuild = versionIsInt ? versionValue.asInt() : -1;
     if (!versionIsInt || listBuild != runningBuild) {
         m_errno = ERROR_CODE_BAD_FIX_NUMBER;
+        // KEPT: "verison" is the text log readers search for.
         syslog(LOG_ERR, "%s:%d verison not match, original buildnumber[%d], json buildnumber[%d]",
                kModule, __LINE__, runningBuild, listBuild);
         return false;

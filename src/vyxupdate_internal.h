@@ -74,7 +74,7 @@ constexpr char kStepLetters[] = "UAPCR";
 static_assert(sizeof(kStepLetters) - 1 == UPDATE_STEP_R - UPDATE_STEP_U + 1,
               "one letter for every installer step");
 
-// Version numbers are compared after conversion with automatic base: "0x" hex, a leading
+// KEPT: version numbers are compared after conversion with automatic base: "0x" hex, a leading
 // "0" octal, anything unparsable 0.
 inline long ToNumber(const char* text) {
     return strtol(text, nullptr, 0);

@@ -116,6 +116,7 @@ bool AnnouncedLengthToNumber(const char* sizeText, kyto::UniqueSzList& pieces,
 int ReadDownloadPid(int missingPriority) {
     const int pid = KLIBCReadPidFile(kPidFile);
     if (pid < 0) {
+        // KEPT: "dose" is the text log readers search for.
         syslog(missingPriority, "%s:%d [%s] dose not exist", kModule, __LINE__, kPidFile);
     } else if (pid == 0) {
         syslog(LOG_ERR, "%s:%d Invalid pid [%d] in pid file [%s]", kModule, __LINE__, pid,

@@ -110,7 +110,7 @@ int VyxUpdate::IsHotfix(const _tag_vyxinfo_& current, const _tag_vyxinfo_& candi
 }
 
 int VyxUpdate::SatisfyReqVersion(const _tag_vyxinfo_& current, const _tag_vyxinfo_& candidate) {
-    // Any one of the three is enough: the requirement is deliberately not compared as a
+    // KEPT: any one of the three is enough: the requirement is deliberately not compared as a
     // version triple.
     if (ToNumber(current.major) >= ToNumber(candidate.reqMajor))
         return 1;
