@@ -15,23 +15,12 @@ namespace {
 
 const std::string kDir = "/tmp/t/", kImg = kDir + "img", kSig = kImg + ".minisig";
 
-std::string Tool(const std::string& cmd) {
-    std::string out;
-    const int rc = Shell("cd " + kDir + " && " + cmd, &out);
-    return "rc=" + std::to_string(rc) + " " + out;
-}
-
-::testing::AssertionResult Ok(const std::string& out) {
-    if (out.rfind("rc=0 ", 0) == 0)
+// Runs the tool's command line in the work folder; its output goes to *out when asked.
+::testing::AssertionResult Tool(const std::string& cmd, std::string* out = nullptr) {
+    std::string text;
+    if (Shell("cd " + kDir + " && " + cmd, &text) == 0 && (!out || (*out = text, true)))
         return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure() << out;
-}
-
-// A key pair written by the tool itself; with a password, fed on standard input.
-void ToolKeyPair(const std::string& name, const std::string& pw) {
-    const std::string keys = " -p " + name + ".pub -s " + name + ".key";
-    ASSERT_TRUE(Ok(Tool(pw.empty() ? "minisign -G -W" + keys
-                                   : "printf '" + pw + "\\n" + pw + "\\n' | minisign -G" + keys)));
+    return ::testing::AssertionFailure() << cmd << ": " << text;
 }
 
 bool Verify(const std::string& pub, const std::string& name, std::string& why) {
@@ -48,6 +37,11 @@ bool SignWith(const std::string& secPath, const std::string& pw, std::string& wh
            kytotrust::WriteSignature(kImg, text, why);
 }
 
+// The signature file with the text at `at` replaced by `with`.
+std::string Edit(std::string sig, const std::string& at, const std::string& with) {
+    return sig.replace(sig.find(at), at.size(), with);
+}
+
 class KytotrustTest : public SandboxTest {
   protected:
     void SetUp() override {
@@ -60,105 +54,78 @@ class KytotrustTest : public SandboxTest {
     }
 };
 
-// Rows: no password (a plain key), and a password.
-const char* const kPasswords[] = {"", "s3cret pw"};
-
-TEST_F(KytotrustTest, OurKeysAndSignaturesWorkWithTheTool) {
-    for (const std::string pw : kPasswords) {
+// Key pairs made by us or by the tool, plain and with a password fed on standard input: the
+// tool's signature verifies with ours and ours with the tool's, with our trusted comment.
+void BothWays(bool ourKeys) {
+    for (const std::string pw : {"", "s3cret pw"}) {
         SCOPED_TRACE("password '" + pw + "'");
         std::string why;
-        Shell("rm -f /tmp/t/our.* " + kSig);
-        ASSERT_TRUE(kytotrust::GenerateKeyPair(kDir + "our.pub", kDir + "our.key", pw, why)) << why;
-        struct stat st;
-        ASSERT_EQ(stat((kDir + "our.key").c_str(), &st), 0);
-        EXPECT_EQ(st.st_mode & 0777, 0600u);
-        EXPECT_FALSE(kytotrust::GenerateKeyPair(kDir + "new.pub", kDir + "our.key", pw, why));
-        EXPECT_NE(why.find("exists already"), std::string::npos) << why;
-
-        ASSERT_TRUE(SignWith("our.key", pw, why)) << why;
-        const std::string out = Tool("minisign -V -p our.pub -m img");
-        EXPECT_TRUE(Ok(out));
+        Shell("rm -f /tmp/t/k.* " + kSig);
+        if (ourKeys)
+            ASSERT_TRUE(kytotrust::GenerateKeyPair(kDir + "k.pub", kDir + "k.key", pw, why));
+        else
+            ASSERT_TRUE(Tool("printf '" + pw + "\\n" + pw + "\\n' | minisign -G" +
+                             (pw.empty() ? " -W" : "") + " -p k.pub -s k.key"));
+        ASSERT_TRUE(Tool("printf '" + pw + "\\n' | minisign -S -s k.key -m img"));
+        EXPECT_TRUE(Verify("k.pub", "img", why)) << why;
+        ASSERT_TRUE(SignWith("k.key", pw, why)) << why;
+        std::string out;
+        EXPECT_TRUE(Tool("minisign -V -p k.pub -m img", &out));
         EXPECT_TRUE(std::regex_search(
             out, std::regex("\nTrusted comment: timestamp:[0-9]+\tfile:img\thashed\n")))
             << out;
-        // The tool signs with our secret key file; we verify with our public key file.
-        Shell("rm " + kSig);
-        ASSERT_TRUE(Ok(Tool("printf '" + pw + "\\n' | minisign -S -s our.key -m img")));
-        EXPECT_TRUE(Verify("our.pub", "img", why)) << why;
-        if (!pw.empty()) {
-            kytotrust::SecretKey sk;
-            EXPECT_FALSE(kytotrust::LoadSecretKey(kDir + "our.key", "s3cret pW", sk, why));
-            EXPECT_NE(why.find("wrong password"), std::string::npos) << why;
-        }
+        kytotrust::SecretKey sk;
+        EXPECT_EQ(kytotrust::LoadSecretKey(kDir + "k.key", "s3cret pW", sk, why), pw.empty());
+        EXPECT_TRUE(pw.empty() || why.find("wrong password") != std::string::npos) << why;
     }
 }
 
+TEST_F(KytotrustTest, OurKeysAndSignaturesWorkWithTheTool) {
+    BothWays(true);
+}
+
 TEST_F(KytotrustTest, TheToolsKeysAndSignaturesWorkWithOurs) {
-    for (const std::string pw : kPasswords) {
-        SCOPED_TRACE("password '" + pw + "'");
-        std::string why;
-        Shell("rm -f /tmp/t/tool.* " + kSig);
-        ToolKeyPair("tool", pw);
-        ASSERT_TRUE(Ok(Tool("printf '" + pw + "\\n' | minisign -S -s tool.key -m img")));
-        EXPECT_TRUE(Verify("tool.pub", "img", why)) << why;
-        // Our signature with the tool's secret key file, checked by the tool.
-        ASSERT_TRUE(SignWith("tool.key", pw, why)) << why;
-        EXPECT_TRUE(Ok(Tool("minisign -V -p tool.pub -m img")));
-    }
+    BothWays(false);
 }
 
 TEST_F(KytotrustTest, EachRefusalGivesItsReason) {
     std::string why;
-    ToolKeyPair("other", "");
+    ASSERT_TRUE(Tool("minisign -G -W -p other.pub -s other.key"));
     ASSERT_TRUE(kytotrust::GenerateKeyPair(kDir + "a.pub", kDir + "a.key", "", why)) << why;
     ASSERT_TRUE(SignWith("a.key", "", why)) << why;
     const std::string img = *ReadFile(kImg), sig = *ReadFile(kSig);
-    const std::vector<std::string> lines = FileLines(kSig);
     struct Row {
-        const char* what;
+        const char *what, *name, *reason;
         std::function<void()> change;
-        const char* name;
-        const char* reason;
     } rows[] = {
-        {"as signed", [] {}, "img", nullptr},
-        {"no signature file", [] { unlink(kSig.c_str()); }, "img", "unsigned: "},
-        {"another key", [&] { ASSERT_TRUE(SignWith("other.key", "", why)) << why; }, "img",
-         "signed by an unknown key "},
-        {"a byte flipped",
-         [&] { WriteFile(kImg, img.substr(0, 70000) + "\x01" + img.substr(70001)); }, "img",
-         "altered: "},
-        {"trusted comment changed",
-         [&] {
-             WriteFile(kSig,
-                       lines[0] + "\n" + lines[1] + "\n" + lines[2] + "0\n" + lines[3] + "\n");
-         },
-         "img", "trusted comment altered: "},
-        {"another name", [] {}, "other.img", "signed under another name: "},
-        {"bad base64",
-         [&] {
-             WriteFile(kSig, lines[0] + "\n" + lines[1].substr(1) + "\n" + lines[2] + "\n" +
-                                 lines[3] + "\n");
-         },
-         "img", "malformed signature: "},
-        {"cut short", [&] { WriteFile(kSig, sig.substr(0, sig.size() - 40)); }, "img",
-         "malformed signature: "},
-        {"legacy", [] { Tool("rm img.minisig && minisign -S -l -s a.key -m img"); }, "img",
-         "legacy signature: "},
+        {"as signed", "img", "", [] {}},
+        {"no signature file", "img", "unsigned: ", [] { unlink(kSig.c_str()); }},
+        {"another key", "img", "signed by an unknown key ",
+         [&] { ASSERT_TRUE(SignWith("other.key", "", why)) << why; }},
+        {"a byte flipped", "img",
+         "altered: ", [&] { WriteFile(kImg, img.substr(0, 70000) + "\x01" + img.substr(70001)); }},
+        {"trusted comment changed", "img", "trusted comment altered: ",
+         [&] { WriteFile(kSig, Edit(sig, "timestamp:", "timestamp:1")); }},
+        {"another name", "other.img", "signed under another name: ", [] {}},
+        {"bad base64", "img",
+         "malformed signature: ", [&] { WriteFile(kSig, Edit(sig, "\ntrusted", "*\ntrusted")); }},
+        {"cut short", "img",
+         "malformed signature: ", [&] { WriteFile(kSig, sig.substr(0, sig.size() - 40)); }},
+        {"legacy", "img", "legacy signature: ",
+         [] { ASSERT_TRUE(Tool("rm img.minisig && minisign -S -l -s a.key -m img")); }},
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.what);
         WriteFile(kImg, img);
         WriteFile(kSig, sig);
         row.change();
-        const bool ok = Verify("a.pub", row.name, why);
-        EXPECT_EQ(ok, row.reason == nullptr) << why;
-        if (row.reason != nullptr) {
-            EXPECT_EQ(why.rfind(row.reason, 0), 0u) << why;
-        }
+        why.clear();
+        EXPECT_EQ(Verify("a.pub", row.name, why), !*row.reason) << why;
+        EXPECT_EQ(why.rfind(row.reason, 0), 0u) << why;
     }
 }
 
-TEST_F(KytotrustTest, TrustFolderLoadsEveryReadableKey) {
+TEST_F(KytotrustTest, NewKeysAndTheTrustFolder) {
     std::string why;
     std::vector<kytotrust::PublicKey> keys;
     ASSERT_EQ(mkdir("/tmp/t/trusted.d", 0755), 0);
@@ -167,6 +134,11 @@ TEST_F(KytotrustTest, TrustFolderLoadsEveryReadableKey) {
     EXPECT_FALSE(kytotrust::LoadTrustFolder(kDir + "trusted.d", keys, why));
     EXPECT_NE(why.find("junk.pub"), std::string::npos) << why;
     ASSERT_TRUE(kytotrust::GenerateKeyPair(kDir + "trusted.d/a.pub", kDir + "a.key", "", why));
+    struct stat st;
+    ASSERT_EQ(stat((kDir + "a.key").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+    EXPECT_FALSE(kytotrust::GenerateKeyPair(kDir + "b.pub", kDir + "a.key", "", why));
+    EXPECT_NE(why.find("a.key exists already"), std::string::npos) << why;
     WriteFile(kDir + "trusted.d/a.txt", *ReadFile(kDir + "trusted.d/a.pub"));
     ASSERT_TRUE(kytotrust::LoadTrustFolder(kDir + "trusted.d", keys, why)) << why;
     ASSERT_EQ(keys.size(), 1u);
