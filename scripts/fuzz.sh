@@ -14,7 +14,7 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
 BUILD=${KYTO_FUZZ_BUILD:-$ROOT/build-fuzz}
-ALL=(feed_line feed_file patch_list info_file keyvalue download_status apply_stage)
+ALL=(feed_line feed_file patch_list info_file keyvalue download_status apply_stage signature)
 
 LIMIT=-runs=10000000
 TARGETS=()
