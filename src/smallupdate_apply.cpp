@@ -18,6 +18,7 @@
 #include "kyto_paths.h"
 #include "smallupdate_internal.h"
 #include "update_cpputil.h"
+#include "version_file.h"
 
 using namespace kyto::small;
 
@@ -32,7 +33,7 @@ bool RunApplySteps(SmallUpdate& update, int& percentage, SmallUpdate::APPLY_STAG
         return false;
 
     char installed[kApplyFixWidth] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", installed, sizeof(installed),
+    if (KLIBCFileGetKeyValue(kyto::VersionFile(), "smallfixnumber", installed, sizeof(installed),
                              0) <= 0)
         snprintf(installed, sizeof(installed), "%s", "0");
     std::ostringstream line;
@@ -74,7 +75,7 @@ bool RunApplySteps(SmallUpdate& update, int& percentage, SmallUpdate::APPLY_STAG
     // next check offers the fix again.
     char fix[kApplyFixWidth] = {0};
     snprintf(fix, sizeof(fix), "%d", update.m_newSmallFixNumber);
-    return KLIBCFileSetKeyValue(kyto::kVersionFile, "smallfixnumber", fix, nullptr) > 0;
+    return KLIBCFileSetKeyValue(kyto::VersionFile(), "smallfixnumber", fix, nullptr) > 0;
 }
 
 }  // namespace

@@ -21,6 +21,7 @@
 #include "platform_error.h"
 #include "smallupdate_internal.h"
 #include "update_cpputil.h"
+#include "version_file.h"
 
 using namespace kyto::small;
 
@@ -95,7 +96,7 @@ bool SmallUpdate::UpdateConfig() const {
         syslog(LOG_ERR, "%s:%d configupdate not exist", kModule, __LINE__);
         return false;
     }
-    if (KLIBCExec(program.c_str(), "-c", "all", "-p", kyto::kVersionFile) != 0) {
+    if (KLIBCExec(program.c_str(), "-c", "all", "-p", kyto::VersionFile()) != 0) {
         syslog(LOG_ERR, "%s:%d failed to update config", kModule, __LINE__);
         return false;
     }

@@ -24,6 +24,7 @@
 #include "platform_error.h"
 #include "scoped.h"
 #include "smallupdate_internal.h"
+#include "smallupdate_plan.h"
 #include "version_file.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
@@ -33,8 +34,6 @@ using namespace kyto::small;
 namespace {
 
 // Base address of the patch lists when "small_info_path" is not configured.
-constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
-constexpr const char* kPatchListName = "VYX-Security.json";
 
 // libcurl's global state is set up once per process, before the first handle.  It is
 // never torn down: the library may be unloaded while its host still uses libcurl.
@@ -62,7 +61,7 @@ class CurlEasy {
 // Installed small-fix number: "smallfixnumber" of the version file, 0 when it yields nothing.
 int InstalledSmallFixNumber() {
     char buf[kInstalledFixWidth] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kVersionFile, "smallfixnumber", buf, sizeof(buf), 0) <= 0) {
+    if (KLIBCFileGetKeyValue(kyto::VersionFile(), "smallfixnumber", buf, sizeof(buf), 0) <= 0) {
         return 0;
     }
     return static_cast<int>(strtol(buf, nullptr, 10));
@@ -165,7 +164,7 @@ void TakeMerge(SmallUpdate& u, const CustomBugFix& merger, int listBuild) {
 }  // namespace
 
 bool SmallUpdate::DownloadJson(const std::string& outPath) {
-    const std::string base = m_conf.Def("small_info_path", kDefaultSmallInfoPath);
+    const std::string base = m_conf.Def("small_info_path", kyto::kDefaultSmallInfoPath);
     if (outPath.empty()) {
         syslog(LOG_ERR, "%s:%d bad parameter", kModule, __LINE__);
         m_errno = ERROR_CODE_BAD_INPUT;
@@ -178,7 +177,7 @@ bool SmallUpdate::DownloadJson(const std::string& outPath) {
         m_errno = ERROR_CODE_BAD_INPUT;
         return false;
     }
-    const std::string url = base + "/" + build.text + "/" + m_unique + "/" + kPatchListName;
+    const std::string url = kyto::PatchListUrl(base, build.text, m_unique);
 
     InitCurlOnce();
     CurlEasy curl;
@@ -300,7 +299,7 @@ bool SmallUpdate::HaveNewFix() {
 bool SmallUpdate::CheckPatchIsSmallUpdate(const std::string& archive, bool& isSmallUpdate) {
     char command[kArchiveCommandWidth] = {0};
     snprintf(command, sizeof(command), "/bin/tar -tf %s | /bin/grep '%s' | wc -l", archive.c_str(),
-             kPatchListName);
+             kyto::kPatchListName);
     kyto::UniqueFile pipe(popen(command, "re"), kyto::UniqueFile::kPopen);
     if (!pipe) {
         return false;
@@ -330,7 +329,7 @@ bool SmallUpdate::ImportSmallPatch(const std::string& archive, const std::string
         syslog(LOG_ERR, "%s:%d failed to untar file %s", kModule, __LINE__, archive.c_str());
         return false;
     }
-    if (!SetUpdateList(m_debDir + "/" + kPatchListName)) {
+    if (!SetUpdateList(m_debDir + "/" + kyto::kPatchListName)) {
         syslog(LOG_ERR, "%s:%d failed to set update list", kModule, __LINE__);
         return false;
     }

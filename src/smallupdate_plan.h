@@ -1,7 +1,7 @@
-// What a small update fetches and which start-up scripts a restart of all services runs:
-// the one definition that the download, the service restart and the driver's plan and
-// progress display all use.  Internal header: not installed; header-only, so that programs
-// built in this tree use it without an exported symbol.
+// Where a small update's patch list is, what a small update fetches and which start-up
+// scripts a restart of all services runs: the one definition that the lookup, the
+// download, the service restart and the programs in tools/ all use.  Internal header: not
+// installed; header-only, so that programs built in this tree use it without an exported symbol.
 #ifndef KYTOINSTALLCPP_SMALLUPDATE_PLAN_H
 #define KYTOINSTALLCPP_SMALLUPDATE_PLAN_H
 
@@ -14,6 +14,17 @@
 #include "smallupdate.h"
 
 namespace kyto {
+
+// The patch list's name, and the base of its address when "small_info_path" of the
+// information file names none.
+constexpr const char* kPatchListName = "VYX-Security.json";
+constexpr const char* kDefaultSmallInfoPath = "http://update.kyto.local/smallupdate";
+
+// Where the patch list of a build and model is: "<base>/<build>/<unique>/VYX-Security.json".
+inline std::string PatchListUrl(const std::string& base, const std::string& build,
+                                const std::string& unique) {
+    return base + "/" + build + "/" + unique + "/" + kPatchListName;
+}
 
 // Folder of the start-up scripts and the scripts a restart of all services runs.
 constexpr const char* kRcDir = "/usr/kyto/etc/rc.d";

@@ -252,7 +252,7 @@ bool KeyReadable(const char* key, int result) {
 
 int UpdateUtil::GetUserAgent(std::string& agent) {
     char szUnique[128] = {0};
-    if (!KeyReadable("unique", KLIBCFileGetKeyValue(kyto::kInfoConfFile, "unique", szUnique,
+    if (!KeyReadable("unique", KLIBCFileGetKeyValue(kyto::InfoConfFile(), "unique", szUnique,
                                                     sizeof(szUnique), 0)))
         return 0;
     const kyto::VersionKey<64> build("buildnumber");

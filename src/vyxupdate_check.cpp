@@ -22,6 +22,7 @@
 #include "scoped.h"
 #include "update_cpputil.h"
 #include "vyxupdate_internal.h"
+#include "version_file.h"
 
 using namespace kyto::vyx;
 
@@ -62,18 +63,18 @@ int VyxUpdate::GetRssFile() {
     memset(server, 0, sizeof(server));
     memset(timezone, 0, sizeof(timezone));
 
-    int ret = KLIBCFileGetKeyValue(kyto::kInfoConfFile, "rss_server", server, sizeof(server), 0);
+    int ret = KLIBCFileGetKeyValue(kyto::InfoConfFile(), "rss_server", server, sizeof(server), 0);
     if (ret < 0) {
         syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, "rss_server",
-               kyto::kInfoConfFile, kyto::LastErrorText().c_str());
+               kyto::InfoConfFile(), kyto::LastErrorText().c_str());
         return 0;
     }
     if (ret == 0)
         snprintf(server, sizeof(server), "%s", kDefaultRssServer);
 
-    if (KLIBCFileGetKeyValue(kyto::kInfoConfFile, "timezone", timezone, sizeof(timezone), 0) < 1) {
+    if (KLIBCFileGetKeyValue(kyto::InfoConfFile(), "timezone", timezone, sizeof(timezone), 0) < 1) {
         syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, "timezone",
-               kyto::kInfoConfFile, kyto::LastErrorText().c_str());
+               kyto::InfoConfFile(), kyto::LastErrorText().c_str());
         return 0;
     }
 

@@ -216,11 +216,11 @@ bool VyxUpdate::ParseTagValue(const std::string& line, std::string& name, std::s
     return true;
 }
 
-int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool& found,
-                            _tag_vyxinfo_& release) {
-    kyto::UniqueFd fd(open(kRssFile, O_RDONLY | O_CLOEXEC));
+int kyto::vyx::ReadFeed(const char* path, bool hotfixOnly, const _tag_vyxinfo_& current,
+                        bool& found, _tag_vyxinfo_& release) {
+    kyto::UniqueFd fd(open(path, O_RDONLY | O_CLOEXEC));
     if (!fd.valid()) {
-        syslog(LOG_ERR, "%s:%d Fail to open [%s]", kModule, __LINE__, kRssFile);
+        syslog(LOG_ERR, "%s:%d Fail to open [%s]", kModule, __LINE__, path);
         return 0;
     }
     found = false;
@@ -267,7 +267,7 @@ int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool&
         KindOfName(t.left, t.leftLen, type);
         memcpy(value, t.value, t.valueLen);
         value[t.valueLen] = '\0';
-        SetVyxInfo(type, value, release);
+        VyxUpdate::SetVyxInfo(type, value, release);
         if (IsVersionKind(type))
             wanted = -1;
         if (!inModel)
@@ -293,4 +293,9 @@ int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool&
         }
     }
     return 1;
+}
+
+int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool& found,
+                            _tag_vyxinfo_& release) {
+    return ReadFeed(kRssFile, hotfixOnly, current, found, release);
 }

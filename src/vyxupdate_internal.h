@@ -99,6 +99,11 @@ struct KeyRead {
 // True when every key was read.
 bool ReadKeys(std::initializer_list<KeyRead> reads);
 
+// The feed reader: the feed file at path read as VyxUpdate::ParseRssFile reads the fetched
+// feed (which it calls with that file), for this device as current describes it.
+int ReadFeed(const char* path, bool hotfixOnly, const _tag_vyxinfo_& current, bool& found,
+             _tag_vyxinfo_& release);
+
 }  // namespace vyx
 }  // namespace kyto
 

@@ -11,6 +11,7 @@
 #include "kyto_paths.h"
 #include "platform_error.h"
 #include "vyxupdate_internal.h"
+#include "version_file.h"
 
 using namespace kyto::vyx;
 
@@ -26,14 +27,14 @@ bool kyto::vyx::ReadKeys(std::initializer_list<KeyRead> reads) {
 }
 
 int VyxUpdate::GetVyxInfo(_tag_vyxinfo_& info) {
-    const char* version = kyto::kVersionFile;
+    const char* version = kyto::VersionFile();
     return ReadKeys({
                {version, "majorversion", "majorversion", info.major, sizeof(info.major)},
                {version, "minorversion", "minorversion", info.minor, sizeof(info.minor)},
                {version, "buildphase", "buildphase", info.buildPhase, sizeof(info.buildPhase)},
                {version, "buildnumber", "buildnumber", info.buildNum, sizeof(info.buildNum)},
                {version, "builddate", "builddate", info.buildDate, sizeof(info.buildDate)},
-               {kyto::kInfoConfFile, "unique", "unique", info.unique, sizeof(info.unique)},
+               {kyto::InfoConfFile(), "unique", "unique", info.unique, sizeof(info.unique)},
            })
                ? 1
                : 0;
