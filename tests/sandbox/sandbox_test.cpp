@@ -115,21 +115,6 @@ TEST_F(SandboxSelfTest, SyslogKeepsPriorityTagAndTextFromEveryProcess) {
     EXPECT_EQ(SyslogMessages(LOG_INFO), std::vector<std::string>{"child says 7"});
 }
 
-TEST_F(SandboxSelfTest, VolumesHaveExactFreeSpaceAndReadOnlyFlag) {
-    const unsigned long long page = static_cast<unsigned long long>(sysconf(_SC_PAGESIZE));
-    MountVolume("/volume1", 209715200ULL);
-    MountVolume("/volume2", 3 * page, true);
-    for (auto [path, size, readOnly] :
-         {std::tuple{"/volume1", 209715200ULL, false}, std::tuple{"/volume2", 3 * page, true}}) {
-        struct statvfs vfs;
-        ASSERT_EQ(statvfs(path, &vfs), 0);
-        EXPECT_EQ(static_cast<unsigned long long>(vfs.f_bavail) * vfs.f_frsize, size) << path;
-        EXPECT_EQ(ReadOnly(path), readOnly) << path;
-    }
-    UnmountVolume("/volume1");
-    UnmountVolume("/volume2");
-}
-
 // The leak checks of the base fixture depend on these two probes seeing a leak.
 TEST(SandboxLeakProbes, SeeNewDescriptorsAndUnreapedChildren) {
     std::vector<int> before = OpenFds();

@@ -49,11 +49,12 @@ TEST_F(SmallUpdateDownloadTest, StopMarkerBeforeBetweenAndAfterFiles) {
             WriteFile(kMarker, "");
         const std::string first =
             kDir + "/" + (when == kAfter ? u.m_smallUpdateDeb : u.m_installDebs[0]);
-        // A poller sees each finished file: two of three when the last one is on its way.
+        // A poller sees each finished file: none while the first is on its way, two of three
+        // when the last one is.
         const pid_t canceller = Spawn([&] {
             return when == kBefore ||
                            (WaitFor([&] { return PathExists(first); }) &&
-                            (when != kAfter || SmallDownloadSeen() == "66 downloading") &&
+                            SmallDownloadSeen() == (when == kAfter ? "66 downloading" : "0 init") &&
                             SmallUpdate().CancelDownload())
                        ? 0
                        : 1;

@@ -237,4 +237,27 @@ Json::Value EntryJson(int version, const std::vector<Json::Value>& proj, const J
     return e;
 }
 
+DebPackage SmallFixPackage() {
+    return MakeDebPackage("kyto-tool-fix", SmallFixVersion("1.0", 5644, 1));
+}
+
+std::string SmallFixDeb() {
+    return DebFileName(SmallFixPackage());
+}
+
+std::string SmallFixList(const UpdateServer& server) {
+    PatchEntry fix;
+    fix.version = 1;
+    fix.proj = {{"kyto-tool-fix", server.Url("/debs/" + SmallFixDeb())},
+                {"smallupdate", server.Url("/debs/kyto-su_5.2-5644-s1_all.deb")}};
+    fix.restart = R"({"vyx_service":["S01iptables.sh"],"pkg":["DemoApp"]})";
+    return PatchListJson(5644, "demo_model", {fix});
+}
+
+void PublishSmallFix(UpdateServer& server) {
+    BuildDeb(SmallFixPackage(), server.Root() + "/debs");
+    BuildDeb(MakeDebPackage("kyto-su", SmallFixVersion("5.2", 5644, 1)), server.Root() + "/debs");
+    server.PutFile(UpdateServer::PatchListPath(5644, "demo_model"), SmallFixList(server));
+}
+
 }  // namespace kytotest

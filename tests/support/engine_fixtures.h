@@ -119,6 +119,14 @@ class PatchListTest : public UpdateServerTest {
     // web) and a configuration fix 4 (restarting samba): out of ascending order.
     std::vector<PatchEntry> RealisticList();
 };
+// Fix 1 of build 5644 as the driver and the facade see it: the further package
+// "kyto-tool-fix" and the small-update package "kyto-su", restarting S01iptables.sh and the
+// add-on "DemoApp".  The further package, its file name and the patch list with links on
+// `server`; PublishSmallFix builds both packages into the server's /debs and serves the list.
+DebPackage SmallFixPackage();
+std::string SmallFixDeb();
+std::string SmallFixList(const UpdateServer& server);
+void PublishSmallFix(UpdateServer& server);
 // Replaces the provisioned start-up scripts and the package control program with probes
 // that record their arguments and the apply status ("percentage/stage", or "none") a
 // poller would have read at the moment they ran.

@@ -270,6 +270,12 @@ std::vector<std::string> SyslogMessages(int priority) {
     return messages;
 }
 
+testing::AssertionResult Has(const std::string& text, const std::string& part) {
+    if (text.find(part) != std::string::npos)
+        return testing::AssertionSuccess();
+    return testing::AssertionFailure() << "no \"" << part << "\" in:\n" << text;
+}
+
 bool SyslogContains(const std::string& text, int priority) {
     for (const std::string& message : SyslogMessages(priority)) {
         if (message.find(text) != std::string::npos)

@@ -67,6 +67,8 @@ std::vector<std::string> SyslogMessages(int priority = -1);
 bool SyslogContains(const std::string& text, int priority = -1);
 // Forgets the lines received so far (later calls only see newer lines).
 void ClearSyslog();
+// Success when text contains part; a failure shows the whole text.
+testing::AssertionResult Has(const std::string& text, const std::string& part);
 
 // ---- Files ------------------------------------------------------------------------------
 

@@ -255,6 +255,15 @@ void UpdateServer::PointRssServerHere() const {
     SetKeyValue("/etc.defaults/kytoinfo.conf", "rss_server", Url("/autoupdate/genRSS.php"));
 }
 
+void UpdateServer::PublishRelease(const std::string& build, const std::string& imagePath,
+                                  unsigned long long bytes, long bytesPerSecond) {
+    const std::string md5 = Md5Of(PutFileOfSize(imagePath, bytes));
+    if (bytesPerSecond)
+        SlowPath(imagePath, bytesPerSecond);
+    PutFile("/autoupdate/genRSS.php",
+            FeedDocument(FeedItem("5", "2", build, {{"demo_model", Url(imagePath), md5}})));
+}
+
 void UpdateServer::PointSmallInfoPathHere() const {
     SetKeyValue("/etc.defaults/kytoinfo.conf", "small_info_path", Url("/smallupdate"));
 }

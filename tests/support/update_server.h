@@ -80,6 +80,11 @@ class UpdateServer {
     // Points the appliance at this server: sets rss_server="<BaseUrl>/autoupdate/genRSS.php"
     // in /etc.defaults/kytoinfo.conf.
     void PointRssServerHere() const;
+    // Publishes release 5.2 build `build` for "demo_model" at the feed path of
+    // PointRssServerHere, its image of `bytes` served at imagePath (at bytesPerSecond when
+    // given).
+    void PublishRelease(const std::string& build, const std::string& imagePath,
+                        unsigned long long bytes, long bytesPerSecond = 0);
     // Points the small-update lookup at this server: small_info_path="<BaseUrl>/smallupdate".
     void PointSmallInfoPathHere() const;
     // URL path of the patch list the lookup fetches for a build and model:

@@ -11,9 +11,7 @@
 #include <string>
 #include <vector>
 
-#include "deb_builder.h"
-#include "sandbox.h"
-#include "update_server.h"
+#include "engine_fixtures.h"
 
 using namespace kytotest;
 
@@ -40,12 +38,6 @@ Outcome Cmd(const std::string& args) {
     return {args, rc, ReadFile("/tmp/k.out").value_or(""), ReadFile("/tmp/k.err").value_or("")};
 }
 
-testing::AssertionResult Has(const std::string& text, const std::string& part) {
-    if (text.find(part) != std::string::npos)
-        return testing::AssertionSuccess();
-    return testing::AssertionFailure() << "no \"" << part << "\" in:\n" << text;
-}
-
 void ExpectRuns(const std::vector<Outcome>& rows) {
     for (const Outcome& row : rows) {
         SCOPED_TRACE(row.args);
@@ -66,33 +58,8 @@ class KytoupdateTest : public UpdateServerTest {
     }
     // Serves release 5.2-5700 with an image of the given size, sent at bytesPerSecond.
     void Release(unsigned long long bytes, long bytesPerSecond = 0) {
-        const std::string md5 = Md5Of(server->PutFileOfSize("/img/vyx.img", bytes));
-        if (bytesPerSecond)
-            server->SlowPath("/img/vyx.img", bytesPerSecond);
-        server->PutFile(kFeed,
-                        FeedDocument(FeedItem("5", "2", "5700",
-                                              {{"demo_model", server->Url("/img/vyx.img"), md5}})));
+        server->PublishRelease("5700", "/img/vyx.img", bytes, bytesPerSecond);
     }
-    // Publishes fix 1: a further package and the small-update package, restarting
-    // S01iptables.sh and the add-on "DemoApp".
-    void SmallFix() {
-        BuildDeb(FixPackage(), server->Root() + "/debs");
-        BuildDeb(MakeDebPackage("kyto-su", SmallFixVersion("5.2", 5644, 1)),
-                 server->Root() + "/debs");
-        server->PutFile(UpdateServer::PatchListPath(5644, "demo_model"), PatchList());
-    }
-    static DebPackage FixPackage() {
-        return MakeDebPackage("kyto-tool-fix", SmallFixVersion("1.0", 5644, 1));
-    }
-    std::string PatchList() const {
-        PatchEntry fix;
-        fix.version = 1;
-        fix.proj = {{"kyto-tool-fix", server->Url("/debs/" + Deb())},
-                    {"smallupdate", server->Url("/debs/kyto-su_5.2-5644-s1_all.deb")}};
-        fix.restart = R"({"vyx_service":["S01iptables.sh"],"pkg":["DemoApp"]})";
-        return PatchListJson(5644, "demo_model", {fix});
-    }
-    static std::string Deb() { return DebFileName(FixPackage()); }
 };
 
 TEST_F(KytoupdateTest, BadArgumentsAreNamedAndHelp) {
@@ -116,7 +83,7 @@ TEST_F(KytoupdateTest, CheckTellsKindVersionOrWhyNot) {
                 {"plan --json", 3, "{}\n", ""},
                 {"auto", 0, "none\n", ""},
                 {"cancel", 1, "", "nothing to cancel"}});
-    SmallFix();
+    PublishSmallFix(*server);
     ExpectRuns({{"check", 0, "smallupdate VYX 5.2-5644 update 1\n", ""}});
     Release(1 << 20);  // a full release wins over the small update
     ExpectRuns({{"check", 0, "vyx VYX 5.2-5700\n", ""}});
@@ -129,7 +96,7 @@ TEST_F(KytoupdateTest, CheckTellsKindVersionOrWhyNot) {
 }
 
 TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
-    SmallFix();
+    PublishSmallFix(*server);
     Outcome r = Cmd("download");
     ASSERT_EQ(0, r.rc) << r.err;
     // Not a terminal: plain lines, the last one tells what was downloaded.
@@ -149,7 +116,7 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
         "install":["kyto-tool-fix_1.0-5644-s1_all.deb"], "unpack":"", "flash":"",
         "configUpdate":false, "restart":"partial", "packages":["DemoApp"], "services":[
         {"script":"S01iptables.sh","known":true,"section":"helptoc","key":"system_network"}]})");
-    for (const std::string& deb : {Deb(), std::string("kyto-su_5.2-5644-s1_all.deb")})
+    for (const std::string& deb : {SmallFixDeb(), std::string("kyto-su_5.2-5644-s1_all.deb")})
         plan["download"].append(server->Url("/debs/" + deb));
     r = Cmd("plan --json");
     EXPECT_EQ(0, r.rc) << r.err;
@@ -157,7 +124,7 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
     EXPECT_TRUE(Has(Cmd("plan").out,
                     "restart: partial\n  service S01iptables.sh  section "
                     "helptoc key system_network\n  package DemoApp\n"));
-    EXPECT_TRUE(server->RequestsFor("/debs/" + Deb()).empty());  // nothing downloaded
+    EXPECT_TRUE(server->RequestsFor("/debs/" + SmallFixDeb()).empty());  // nothing downloaded
 
     ClearRecordedCalls();
     ExpectRuns({{"apply", 0, "applied VYX 5.2-5644 update 1\n", "starting services"}});
@@ -173,9 +140,9 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
 
 TEST_F(KytoupdateTest, ImportServicesAndApplyOfALocalArchive) {
     const std::string dir = "/tmp/patch";
-    BuildDeb(FixPackage(), dir);
-    WriteFile(dir + "/VYX-Security.json", PatchList());
-    ASSERT_EQ(0, Shell("tar -cf /tmp/patch.tar -C " + dir + " VYX-Security.json " + Deb()));
+    BuildDeb(SmallFixPackage(), dir);
+    WriteFile(dir + "/VYX-Security.json", SmallFixList(*server));
+    ASSERT_EQ(0, Shell("tar -cf /tmp/patch.tar -C " + dir + " VYX-Security.json " + SmallFixDeb()));
     WriteFile("/tmp/other.tar", "not an archive");
     ExpectRuns({{"services stop", 1, "", "no downloaded update"},  // nothing imported yet
                 {"import /tmp/other.tar", 1, "", "not a small-update archive"},
@@ -191,7 +158,7 @@ TEST_F(KytoupdateTest, ImportServicesAndApplyOfALocalArchive) {
 }
 
 TEST_F(KytoupdateTest, AutoAppliesASmallUpdateAndLeavesAReleaseForTheInstaller) {
-    SmallFix();
+    PublishSmallFix(*server);
     Outcome r = Cmd("auto");
     ASSERT_EQ(0, r.rc) << r.err;
     EXPECT_TRUE(Has(r.out, "applied VYX 5.2-5644 update 1\n"));
