@@ -64,9 +64,12 @@ class KytositeTest : public UpdateServerTest {
         for (size_t i = 0; i < bytes.size(); i += 4096)
             bytes[i] = static_cast<char>(i >> 12);
         WriteFile(image, bytes);
-        const Outcome r = Site("release " + root + " " + image +
-                               " --version 5.2-5700 --model other_model --model demo_model");
-        ASSERT_EQ(0, r.rc) << r.err;
+        // The newer release, published later, comes first in the feed.
+        for (const char* version : {"5.2-5650", "5.2-5700"}) {
+            const Outcome r = Site("release " + root + " " + image + " --version " + version +
+                                   " --model other_model --model demo_model");
+            ASSERT_EQ(0, r.rc) << r.err;
+        }
     }
     // Fix 1: the small-update package and kyto-fix-a, restarting S01iptables.sh; fix 2: a
     // newer small-update package and kyto-fix-b, restarting the add-on DemoApp.
