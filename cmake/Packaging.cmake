@@ -4,7 +4,8 @@
 #
 #   libkytoinstallcpp0     the two shared libraries
 #   libkytoinstallcpp-dev  headers, the .so links, the pkg-config file and the CMake package
-#   kytoupdate             the command-line driver, its manual page, the systemd units
+#   kytoupdate             the command-line driver, the site tool kytosite, their manual pages,
+#                          the systemd units
 #
 # The libraries' and development files' install rules carry no component, so they all land in
 # CPack's "Unspecified" component; a pre-build script (written below) moves the shared
@@ -65,7 +66,8 @@ set(CPACK_DEBIAN_DRIVER_PACKAGE_DEPENDS "${KYTO_DEB_RUNTIME} ${KYTO_DEB_EXACT}")
 set(CPACK_COMPONENT_DRIVER_DESCRIPTION
     "kytoupdate: command-line driver of the appliance's updates\n"
     "check, download with progress, status (JSON), cancel, apply with the service restart,\n"
-    "import of a local patch archive, plan, and the daily auto-update job (systemd timer).")
+    "import of a local patch archive, plan, and the daily auto-update job (systemd timer);\n"
+    "kytosite, the vendor's tool that makes, signs and checks an update site.")
 # dpkg-shlibdeps finds the project's own libraries in the build tree; the exact dependency
 # on the runtime package above stands for them.
 set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS_PRIVATE_DIRS

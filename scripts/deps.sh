@@ -1,10 +1,11 @@
 # Debian packages needed to build and test the project; sourced by build.sh and test.sh.
 # Installs only what is missing, so a second run does not touch apt at all.
 # libcli11-dev: the header-only option parser of the command-line driver (tools/).
+# libssl-dev: the MD5 kytosite computes while it copies a release image.
 # libsodium-dev: the signatures of published files (tools/trust); minisign checks that ours
 # and its files agree (tests/tools/kytotrust_test.cpp).
 KYTO_BUILD_PACKAGES=(cmake g++ make pkg-config libjsoncpp-dev libcurl4-openssl-dev libcli11-dev
-    libsodium-dev)
+    libsodium-dev libssl-dev)
 KYTO_TEST_PACKAGES=(googletest libgtest-dev libgmock-dev libbenchmark-dev wget openssl tar
     dpkg dpkg-dev python3 util-linux clang-format ca-certificates minisign)
 # Hardening checks (scripts/hardening.sh): libFuzzer targets built with clang, its runtime
