@@ -61,6 +61,13 @@ std::string Hex(const unsigned char* bytes, unsigned int len) {
     return text;
 }
 
+// The verifier's reason with the local copy's path put back as the address it came from.
+std::string Published(std::string why, const std::string& path, const std::string& url) {
+    for (size_t at = why.find(path); at != std::string::npos; at = why.find(path, at + url.size()))
+        why.replace(at, path.size(), url);
+    return why;
+}
+
 }  // namespace
 
 TempDir::TempDir() {
@@ -150,7 +157,7 @@ bool Site::Get(const std::string& url, bool followRedirects, bool missingIsProbl
         std::string why;
         file.signedState = kytotrust::VerifyFile(keys, path, sig, BaseName(url), why) ? 1 : 0;
         if (file.signedState == 0)
-            Problem(url + ": " + why);
+            Problem(url + ": " + Published(why, path, url));
     }
     report.files.push_back(file);
     return true;
