@@ -83,10 +83,10 @@ class KytositeCheckTest : public UpdateServerTest {
 TEST_F(KytositeCheckTest, ConsistentSignedSitePassesWithEveryFileAndItsSize) {
     const std::string version = ReadFile("/etc.defaults/VERSION").value_or("");
     std::string out;
-    ASSERT_EQ(0, Check("--version 5.2 --trust /tmp/trust --json", &out)) << out;
+    ASSERT_EQ(0, Check("--version 5.1 --trust /tmp/trust --json", &out)) << out;
     const Json::Value doc = ParseJson(out);
     EXPECT_EQ("VYX 5.2-5700", doc["offered"]["release"].asString());
-    EXPECT_EQ("VYX 5.2-5644 update 1", doc["offered"]["smallupdate"].asString());
+    EXPECT_EQ("VYX 5.1-5644 update 1", doc["offered"]["smallupdate"].asString());
     EXPECT_EQ(0u, doc["problems"].size()) << out;
     const std::vector<std::string> fetched = {kFeed, kImg, kList, kApp, kSu};
     ASSERT_EQ(fetched.size(), doc["files"].size()) << out;
@@ -101,7 +101,9 @@ TEST_F(KytositeCheckTest, ConsistentSignedSitePassesWithEveryFileAndItsSize) {
     EXPECT_FALSE(PathExists("/var/run/autoupdate_tmp_file_RSS"));
     EXPECT_FALSE(AnyEntryStartsWith("/tmp", "kytosite-check."));
 
-    // An appliance at fix 1 without a version: no fix, the feed unread; text output.
+    // An appliance at fix 1 without a version: the feed unread, and fix 1 (whose package
+    // name would be refused) never merged, so nothing offered and nothing wrong.
+    List(5644, "demo_model", kDebs + "kyto-app_1.0_all.deb");
     ASSERT_EQ(0, Check("--smallfix 1", &out)) << out;
     EXPECT_EQ("none\nfile " + server->Url(kList) + " " +
                   std::to_string(std::filesystem::file_size(Local(kList))) + "\n",
