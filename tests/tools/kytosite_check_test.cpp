@@ -31,8 +31,11 @@ class KytositeCheckTest : public UpdateServerTest {
   protected:
     void SetUp() override {
         UpdateServerTest::SetUp();
-        ASSERT_TRUE(Key("/tmp/trust/vendor.pub", "/tmp/vendor.sec"));
-        ASSERT_TRUE(Key("/tmp/other.pub", "/tmp/other.sec"));
+        ASSERT_EQ(0, mkdir("/tmp/trust", 0700));
+        for (const std::string key : {"/tmp/trust/vendor", "/tmp/other"}) {
+            std::string why;
+            ASSERT_TRUE(kytotrust::GenerateKeyPair(key + ".pub", key + ".sec", "", why)) << why;
+        }
         Publish();
     }
     // The consistent site: release 5.2-5700 for two models, fix 1 of build 5644, all signed.
@@ -44,11 +47,6 @@ class KytositeCheckTest : public UpdateServerTest {
         List(5644, "demo_model", kApp);
         for (const std::string& path : {std::string(kFeed), kImg, kList, kApp, kSu})
             Sign(path);
-    }
-    static bool Key(const std::string& pub, const std::string& sec) {
-        std::string why;
-        mkdir("/tmp/trust", 0700);
-        return kytotrust::GenerateKeyPair(pub, sec, "", why) || (ADD_FAILURE() << why, false);
     }
     std::string Local(const std::string& urlPath) const { return server->Root() + urlPath; }
     void Feed(const std::string& md5) {
@@ -64,7 +62,7 @@ class KytositeCheckTest : public UpdateServerTest {
     }
     // Signs the published file under a name (its own by default) with a key.
     void Sign(const std::string& urlPath, std::string name = "",
-              const std::string& sec = "/tmp/vendor.sec") {
+              const std::string& sec = "/tmp/trust/vendor.sec") {
         kytotrust::SecretKey key;
         std::string why, text;
         name = name.empty() ? urlPath.substr(urlPath.rfind('/') + 1) : name;
