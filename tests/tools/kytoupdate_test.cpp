@@ -11,89 +11,12 @@
 #include <string>
 #include <vector>
 
-#include "deb_builder.h"
+#include "kytoupdate_fixture.h"
 #include "sandbox.h"
-#include "update_server.h"
 
 using namespace kytotest;
 
 namespace {
-
-const char* const kFeed = "/autoupdate/genRSS.php";
-
-// The program built beside this test program (build/tests/.. -> build/tools/kytoupdate).
-std::string Kyto() {
-    return std::filesystem::read_symlink("/proc/self/exe").parent_path().string() +
-           "/../tools/kytoupdate";
-}
-
-// One run: arguments, exit code, standard output and standard error.  In a table of
-// expected runs, err is a part of standard error ("": nothing on it).
-struct Outcome {
-    std::string args;
-    int rc;
-    std::string out, err;
-};
-
-Outcome Cmd(const std::string& args) {
-    const int rc = Shell(Kyto() + " " + args + " >/tmp/k.out 2>/tmp/k.err");
-    return {args, rc, ReadFile("/tmp/k.out").value_or(""), ReadFile("/tmp/k.err").value_or("")};
-}
-
-testing::AssertionResult Has(const std::string& text, const std::string& part) {
-    if (text.find(part) != std::string::npos)
-        return testing::AssertionSuccess();
-    return testing::AssertionFailure() << "no \"" << part << "\" in:\n" << text;
-}
-
-void ExpectRuns(const std::vector<Outcome>& rows) {
-    for (const Outcome& row : rows) {
-        SCOPED_TRACE(row.args);
-        const Outcome r = Cmd(row.args);
-        EXPECT_EQ(row.rc, r.rc);
-        EXPECT_EQ(row.out, r.out);
-        EXPECT_TRUE(Has(r.err, row.err));
-        EXPECT_EQ(row.err.empty(), r.err.empty()) << r.err;
-    }
-}
-
-class KytoupdateTest : public UpdateServerTest {
-  protected:
-    void SetUp() override {
-        UpdateServerTest::SetUp();
-        server->PointRssServerHere();
-        server->PutFile(kFeed, FeedDocument(""));  // no release on offer
-    }
-    // Serves release 5.2-5700 with an image of the given size, sent at bytesPerSecond.
-    void Release(unsigned long long bytes, long bytesPerSecond = 0) {
-        const std::string md5 = Md5Of(server->PutFileOfSize("/img/vyx.img", bytes));
-        if (bytesPerSecond)
-            server->SlowPath("/img/vyx.img", bytesPerSecond);
-        server->PutFile(kFeed,
-                        FeedDocument(FeedItem("5", "2", "5700",
-                                              {{"demo_model", server->Url("/img/vyx.img"), md5}})));
-    }
-    // Publishes fix 1: a further package and the small-update package, restarting
-    // S01iptables.sh and the add-on "DemoApp".
-    void SmallFix() {
-        BuildDeb(FixPackage(), server->Root() + "/debs");
-        BuildDeb(MakeDebPackage("kyto-su", SmallFixVersion("5.2", 5644, 1)),
-                 server->Root() + "/debs");
-        server->PutFile(UpdateServer::PatchListPath(5644, "demo_model"), PatchList());
-    }
-    static DebPackage FixPackage() {
-        return MakeDebPackage("kyto-tool-fix", SmallFixVersion("1.0", 5644, 1));
-    }
-    std::string PatchList() const {
-        PatchEntry fix;
-        fix.version = 1;
-        fix.proj = {{"kyto-tool-fix", server->Url("/debs/" + Deb())},
-                    {"smallupdate", server->Url("/debs/kyto-su_5.2-5644-s1_all.deb")}};
-        fix.restart = R"({"vyx_service":["S01iptables.sh"],"pkg":["DemoApp"]})";
-        return PatchListJson(5644, "demo_model", {fix});
-    }
-    static std::string Deb() { return DebFileName(FixPackage()); }
-};
 
 TEST_F(KytoupdateTest, BadArgumentsAreNamedAndHelp) {
     ExpectRuns({{"", 64, "", "A subcommand is required"},
@@ -179,7 +102,9 @@ TEST_F(KytoupdateTest, ImportServicesAndApplyOfALocalArchive) {
     WriteFile("/tmp/other.tar", "not an archive");
     ExpectRuns({{"services stop", 1, "", "no downloaded update"},  // nothing imported yet
                 {"import /tmp/other.tar", 1, "", "not a small-update archive"},
-                {"import /tmp/patch.tar", 0, "imported VYX 5.2-5644 update 1\n", ""}});
+                {"import /tmp/patch.tar", 0, "imported VYX 5.2-5644 update 1\n",
+                 "kytoupdate: no trusted keys in /etc/kytoupdate/trusted.d: signatures are not "
+                 "checked\n"}});
     ClearRecordedCalls();
     ExpectRuns({{"services stop", 0, "services stopped: partial\n", ""}});
     const std::vector<std::vector<std::string>> stopped = {{"S01iptables.sh", "stop"},
