@@ -93,11 +93,13 @@ class KytoupdateTrustTest : public KytoupdateTest {
         EXPECT_TRUE(Has(r.out, "downloaded " + what));
     }
     // Nothing of a refused download is left for the installer or an apply.
-    void ExpectNothingUsable(const std::string& err) {
+    // The poller of that kind (release or small update) sees the download failed.
+    void ExpectNothingUsable(const std::string& err, bool release = false) {
         EXPECT_FALSE(PathExists("/autoupd@te.info"));
         EXPECT_FALSE(PathExists(kDebDir));
         EXPECT_FALSE(PathExists(kImage));
-        EXPECT_FALSE(Has(Cmd("status").out, "finished"));
+        const Json::Value status = ParseJson(Cmd("status --json").out);
+        EXPECT_EQ("failed", status[release ? "vyxupdate" : "smallupdate"]["status"].asString());
         ExpectRuns({{"apply", 1, "", "no downloaded update"}});
         EXPECT_TRUE(SyslogContains(err)) << err;
     }
@@ -124,7 +126,7 @@ TEST_F(KytoupdateTrustTest, EachBadSignatureAtEachPlaceIsRefusedAndRemoved) {
             EXPECT_TRUE(Has(r.err, "refused: not signed by a trusted key: " + Base(file)));
             EXPECT_TRUE(Has(r.err, reason));
             EXPECT_FALSE(Has(r.out, "downloaded") || Has(r.out, "applied"));
-            ExpectNothingUsable(reason);
+            ExpectNothingUsable(reason, release);
         }
     }
     EXPECT_FALSE(DpkgInstalled("kyto-tool-fix"));
@@ -147,6 +149,32 @@ TEST_F(KytoupdateTrustTest, SignedUpdatesPassAndAPackageAlteredAfterwardsIsRefus
     SignedSite(true);
     ExpectDownloaded(std::string("vyx VYX 5.2-5700 ") + kImage + "\n");
     EXPECT_EQ(Md5Of(server->Root() + "/img/vyx.img"), Md5Of(kImage));
+}
+
+TEST_F(KytoupdateTrustTest, ASignedListOrFeedThatChangedDuringTheDownloadIsRefused) {
+    for (const bool release : {false, true}) {
+        SCOPED_TRACE(release ? "feed" : "patch list");
+        server->PutFile(kFeed, FeedDocument(""));
+        SignedSite(release);
+        const std::string slow = release ? "/img/vyx.img" : "/debs/" + Deb();
+        server->SlowPath(slow, release ? 256 << 10 : 256);
+        const pid_t pid = Spawn([] { return Shell(Kyto() + " download >/dev/null 2>/tmp/d.err"); });
+        const std::string local = release ? kImage : std::string(kDebDir) + "/" + Deb();
+        ASSERT_TRUE(WaitFor([&local] { return PathExists(local); }));  // checked, downloading
+        PatchEntry reboot{
+            1, {{"kyto-tool-fix", server->Url("/debs/" + Deb())}}, false, false, "\"reboot\""};
+        reboot.proj.push_back({"smallupdate", server->Url("/debs/kyto-su_5.2-5644-s1_all.deb")});
+        const std::string other =
+            FeedItem("5", "2", "5700", {{"demo_model", server->Url(slow), std::string(32, '0')}});
+        server->PutFile(
+            release ? kFeed : ListPath(),
+            release ? FeedDocument(other) : PatchListJson(5644, "demo_model", {reboot}));
+        Sign(release ? kFeed : ListPath());
+        EXPECT_EQ(5, Wait(pid));
+        const std::string err = ReadFile("/tmp/d.err").value_or("");
+        EXPECT_TRUE(Has(err, release ? "does not offer" : "does not name the update"));
+        ExpectNothingUsable(release ? "does not offer" : "does not name the update", release);
+    }
 }
 
 TEST_F(KytoupdateTrustTest, AnArchiveMustCarryTheSignaturesOfItsListAndPackages) {
