@@ -88,7 +88,9 @@ int main(int argc, char** argv) {
     CLI::App app{
         "kytoupdate: finds, downloads and installs updates of the appliance.\n"
         "Exit codes: 0 done (check: update available), 1 failed, 2 update server "
-        "not reachable,\n3 up to date, 4 download stopped, 64 bad command line."};
+        "not reachable,\n3 up to date, 4 download stopped, 5 refused: not signed by a "
+        "trusted key,\n64 bad command line.\nWith keys in /etc/kytoupdate/trusted.d/*.pub "
+        "only signed updates are downloaded,\napplied or imported."};
     app.require_subcommand(1, 1);
     app.set_version_flag("--version", "kytoupdate 0.1.0");
     Options o;

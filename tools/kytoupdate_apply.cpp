@@ -5,6 +5,7 @@
 #include <string>
 
 #include "kytoupdate_common.h"
+#include "kytoupdate_trust.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
 
@@ -58,6 +59,8 @@ int CmdApply() {
     const std::string why = LoadDownloadedSmallUpdate(u);
     if (!why.empty())
         return Fail("nothing to apply: " + why);
+    if (const int refused = TrustPackageFolder(u); refused >= 0)
+        return refused;
     return ApplyWithServices(u, [&u] { return u.Apply(); });
 }
 
@@ -81,6 +84,8 @@ int CmdImport(const std::string& archive) {
     SmallUpdate u;
     if (!u.ImportSmallPatch(archive))
         return Fail("importing " + archive + " failed: " + SmallErrnoText(u.GetErrno()));
+    if (const int refused = TrustPackageFolder(u); refused >= 0)
+        return refused;
     printf("imported %s\n", u.GetFullVersion().c_str());
     return kExitOk;
 }

@@ -6,6 +6,7 @@
 
 #include "kyto_paths.h"
 #include "kytoupdate_common.h"
+#include "kytoupdate_trust.h"
 #include "scoped.h"
 #include "update_cpputil.h"
 
@@ -36,6 +37,8 @@ int CmdAuto() {
     // The download ran in a child: take its record (package folder included) back from the
     // info file before the facade applies it.
     su.m_smallUpdate.ImportInfoFile(kyto::kAutoUpdateInfoFile);
+    if (const int refused = TrustPackageFolder(su.m_smallUpdate); refused >= 0)
+        return refused;
     return ApplyWithServices(su.m_smallUpdate, [&su] { return su.Apply() == 1; });
 }
 

@@ -22,6 +22,7 @@ constexpr int kExitFailed = 1;       // the operation failed
 constexpr int kExitCannotCheck = 2;  // the update server could not be asked
 constexpr int kExitUpToDate = 3;     // no update: the system is up to date
 constexpr int kExitStopped = 4;      // the download was stopped by a cancel
+constexpr int kExitRefused = 5;      // refused: not signed by a trusted key
 constexpr int kExitUsage = 64;       // bad command line
 
 // What SmallUpdate::GetServiceRestartType answers; the library names none of its numbers.

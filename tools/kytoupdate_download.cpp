@@ -19,6 +19,7 @@
 #include "kytoupdate_common.h"
 #include "kytoupdate_progress.h"
 #include "kytoupdate_status.h"
+#include "kytoupdate_trust.h"
 #include "scoped.h"
 #include "smallupdate_plan.h"
 #include "update_cpputil.h"
@@ -228,6 +229,9 @@ int CheckAndDownload(SystemUpdate& su) {
         case DownloadEnd::kDownloaded:
             break;
     }
+    const int refused = TrustDownload(su);
+    if (refused >= 0)
+        return refused;
     std::string where;
     if (su.m_updateType == UpdateUtil::PATCH_TYPE_VYX) {
         bool have = false;
