@@ -26,14 +26,6 @@
 
 using namespace kyto::vyx;
 
-namespace {
-
-// Feed URL used when "rss_server" is not configured: the appliance's default update
-// server followed by the feed script.
-const char* const kDefaultRssServer = "http://update.kyto.local/autoupdate/genRSS.php";
-
-}  // namespace
-
 VyxUpdate::VyxUpdate() : m_checked(false), m_haveNew(false), m_hybridDL(false) {
     ClearRecord(m_release);
     ClearRecord(m_partnerRelease);
@@ -53,8 +45,7 @@ VyxUpdate::VyxUpdate() : m_checked(false), m_haveNew(false), m_hybridDL(false) {
 VyxUpdate::~VyxUpdate() {}
 
 bool VyxUpdate::IsHotfixOnly() {
-    KytoConf conf;
-    return conf.Info("upgradetype", "all") != "all";
+    return kyto::HotfixOnly();
 }
 
 int VyxUpdate::GetRssFile() {
@@ -70,7 +61,7 @@ int VyxUpdate::GetRssFile() {
         return 0;
     }
     if (ret == 0)
-        snprintf(server, sizeof(server), "%s", kDefaultRssServer);
+        snprintf(server, sizeof(server), "%s", kyto::kDefaultRssServer);
 
     if (KLIBCFileGetKeyValue(kyto::InfoConfFile(), "timezone", timezone, sizeof(timezone), 0) < 1) {
         syslog(LOG_ERR, "%s:%d Fail to get [%s] from [%s]. %s", kModule, __LINE__, "timezone",
@@ -88,7 +79,7 @@ int VyxUpdate::GetRssFile() {
     // The command is bounded like a kPathSize buffer: an over-long URL is cut, and the
     // fetch then fails.
     std::string command = std::string(kyto::kWget) + " --user-agent='" + agent + "' -O " +
-                          kRssFile + " " + server + "?tz=" + timezone + " 2> /dev/null";
+                          kyto::kRssFile + " " + server + "?tz=" + timezone + " 2> /dev/null";
     if (command.size() > kPathSize - 1)
         command.resize(kPathSize - 1);
     if (system(command.c_str()) != 0) {
@@ -188,7 +179,7 @@ int EnsureChecked(VyxUpdate& update) {
 int VyxUpdate::CheckVyxRelease() {
     bool hotfixOnly = IsHotfixOnly();
     // The fetched feed never outlives the check.
-    kyto::ScopedUnlink feedCleanup(kRssFile);
+    kyto::ScopedUnlink feedCleanup(kyto::kRssFile);
 
     if (!GetRssFile()) {
         syslog(LOG_ERR, "%s:%d Fail to get RSS file", kModule, __LINE__);

@@ -297,5 +297,5 @@ int kyto::vyx::ReadFeed(const char* path, bool hotfixOnly, const _tag_vyxinfo_& 
 
 int VyxUpdate::ParseRssFile(bool hotfixOnly, const _tag_vyxinfo_& current, bool& found,
                             _tag_vyxinfo_& release) {
-    return ReadFeed(kRssFile, hotfixOnly, current, found, release);
+    return ReadFeed(kyto::kRssFile, hotfixOnly, current, found, release);
 }

@@ -11,6 +11,7 @@
 #include <initializer_list>
 
 #include "vyxupdate.h"
+#include "vyxupdate_plan.h"
 
 namespace kyto {
 namespace vyx {
@@ -18,8 +19,6 @@ namespace vyx {
 // First field of every log line of the full-system update.
 constexpr const char* kModule = "vyxupdate";
 
-// The fetched release feed, read by the feed reader and deleted at the end of the check.
-constexpr const char* kRssFile = "/var/run/autoupdate_tmp_file_RSS";
 // Pid of the running wget child: written by the child, read by the pollers and the canceller.
 constexpr const char* kPidFile = "/var/run/downloadVYX.pid";
 // wget's progress log (its standard error), read for the announced length.

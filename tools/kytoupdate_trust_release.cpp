@@ -16,15 +16,11 @@
 #include "kytoupdate_trust.h"
 #include "scoped.h"
 #include "vyxupdate.h"
+#include "vyxupdate_plan.h"
 
 namespace kytoupdate {
 
 namespace {
-
-// The feed's address when "rss_server" names none, and the fixed path the library's feed
-// reader reads.
-constexpr const char* kDefaultRssServer = "http://update.kyto.local/autoupdate/genRSS.php";
-constexpr const char* kRssFile = "/var/run/autoupdate_tmp_file_RSS";
 
 // One downloaded image: its path, the release record the check chose, the model it is for
 // ("" for this device).
@@ -34,9 +30,12 @@ struct Image {
     std::string unique;
 };
 
+// A text member of the info file's record; "" for anything else (member lookups on a
+// document that is not an object would throw).
 std::string TextMember(const Json::Value& info, const char* key) {
-    const Json::Value& v = info[key];
-    return v.isString() ? v.asString() : "";
+    if (!info.isObject() || !info[key].isString())
+        return "";
+    return info[key].asString();
 }
 
 // The image against "<link>.minisig", fetched into a private folder.  "" or the reason.
@@ -60,7 +59,7 @@ bool FeedOffers(const Image& image) {
         return false;
     if (!image.unique.empty())
         snprintf(current.unique, sizeof(current.unique), "%s", image.unique.c_str());
-    const bool hotfixOnly = KytoConf().Info("upgradetype", "all") != "all";
+    const bool hotfixOnly = kyto::HotfixOnly();
     bool found = false;
     _tag_vyxinfo_ offered{};
     return VyxUpdate::ParseRssFile(hotfixOnly, current, found, offered) == 1 && found &&
@@ -71,18 +70,18 @@ bool FeedOffers(const Image& image) {
 // The feed fetched again with its signature, verified, then read by the library's feed
 // reader on its fixed path (removed afterwards).  "" or the reason.
 std::string CheckFeed(const std::vector<Image>& images) {
-    const TempFolder tmp("/var/run/kytoupdate-feed.XXXXXX");  // same file system as kRssFile
+    const TempFolder tmp("/var/run/kytoupdate-feed.XXXXXX");  // same file system as kyto::kRssFile
     if (!tmp.Made())
         return "cannot make a temporary folder";
-    const std::string url = KytoConf().Def("rss_server", kDefaultRssServer);
+    const std::string url = KytoConf().Def("rss_server", kyto::kDefaultRssServer);
     const std::string name = BaseName(url);
     FetchInto(url, tmp.Path());
     FetchInto(url + ".minisig", tmp.Path());
     std::string why;
     if (!VerifyIn(tmp.Path(), name, why))
         return why;
-    const kyto::ScopedUnlink feedCleanup(kRssFile);
-    if (rename((tmp.Path() + "/" + name).c_str(), kRssFile) != 0)
+    const kyto::ScopedUnlink feedCleanup(kyto::kRssFile);
+    if (rename((tmp.Path() + "/" + name).c_str(), kyto::kRssFile) != 0)
         return "cannot hand the signed feed to the feed reader";
     for (const Image& image : images) {
         if (!FeedOffers(image))
