@@ -13,6 +13,7 @@
 
 #include "kytosite_check_internal.h"
 #include "version_file.h"
+#include "scoped.h"
 
 namespace kytosite {
 
@@ -106,7 +107,7 @@ int RunCheck(const CheckOptions& given) {
             fprintf(stderr, "kytosite: check: %s\n", why.c_str());
         site.trust = true;
     }
-    check::TempDir dir;
+    const kyto::ScopedTempDir dir("/tmp/kytosite-check.XXXXXX");
     std::string versionFile, infoFile;
     if (!dir.Made() || !check::WriteDevice(o, dir.Path(), versionFile, infoFile))
         return Fail("cannot write the device description under /tmp", kExitProblem);

@@ -70,24 +70,6 @@ std::string Published(std::string why, const std::string& path, const std::strin
 
 }  // namespace
 
-TempDir::TempDir() {
-    char name[] = "/tmp/kytosite-check.XXXXXX";
-    if (mkdtemp(name) != nullptr)
-        path_ = name;
-}
-
-TempDir::~TempDir() {
-    if (path_.empty())
-        return;
-    std::error_code ec;
-    std::filesystem::remove_all(path_, ec);
-}
-
-std::string BaseName(const std::string& url) {
-    const size_t slash = url.rfind('/');
-    return slash == std::string::npos ? url : url.substr(slash + 1);
-}
-
 Fetched Fetch(const std::string& url, const std::string& path, bool followRedirects) {
     Fetched got;
     UniqueFile file(fopen(path.c_str(), "we"));
@@ -125,7 +107,7 @@ Fetched Fetch(const std::string& url, const std::string& path, bool followRedire
 
 bool Site::Get(const std::string& url, bool followRedirects, bool missingIsProblem,
                std::string& path, Fetched& got) {
-    path = dir + "/" + std::to_string(++files) + "-" + BaseName(url);
+    path = dir + "/" + std::to_string(++files) + "-" + kytotrust::SignedName(url);
     got = Fetch(url, path, followRedirects);
     if (got.status != 0)
         report.answered = true;
@@ -155,7 +137,8 @@ bool Site::Get(const std::string& url, bool followRedirects, bool missingIsProbl
         if (sigGot.status != 200 || !sigGot.error.empty())
             unlink(sig.c_str());
         std::string why;
-        file.signedState = kytotrust::VerifyFile(keys, path, sig, BaseName(url), why) ? 1 : 0;
+        file.signedState =
+            kytotrust::VerifyFile(keys, path, sig, kytotrust::SignedName(url), why) ? 1 : 0;
         if (file.signedState == 0)
             Problem(url + ": " + Published(why, path, url));
     }

@@ -12,20 +12,6 @@
 namespace kytosite {
 namespace check {
 
-// A private folder (mode 0700) under /tmp, removed with everything in it when it goes away.
-class TempDir {
-  public:
-    TempDir();
-    ~TempDir();
-    TempDir(const TempDir&) = delete;
-    TempDir& operator=(const TempDir&) = delete;
-    bool Made() const { return !path_.empty(); }
-    const std::string& Path() const { return path_; }
-
-  private:
-    std::string path_;
-};
-
 // One GET of a URL into a file.
 struct Fetched {
     long status = 0;              // the HTTP answer; 0: no answer came back
@@ -36,9 +22,6 @@ struct Fetched {
 // Fetches url into path, following redirects when asked (the appliance's wget follows
 // them; its patch-list lookup does not).
 Fetched Fetch(const std::string& url, const std::string& path, bool followRedirects);
-
-// The text after the last "/" of a URL: the name the file is published and signed under.
-std::string BaseName(const std::string& url);
 
 // What the check found.  signedState: -1 not checked (no trust folder), 0 refused, 1 good.
 struct Report {

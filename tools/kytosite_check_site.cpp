@@ -65,7 +65,7 @@ int NamePackagesRefused(Site& site, const std::string& path) {
         for (const Json::Value& package : entry["proj"]) {
             if (!package.isObject() || !package["url"].isString())
                 continue;
-            const std::string name = BaseName(package["url"].asString());
+            const std::string name = kytotrust::SignedName(package["url"].asString());
             const int fix = DebianLib::FindSmallFixNumfromDeb(name);
             if (fix < 1)
                 site.Problem("package name rejected by the rules: " + name);

@@ -13,6 +13,7 @@
 #include "kytosite_site.h"
 #include "vyxupdate.h"
 #include "vyxupdate_internal.h"
+#include "kytotrust.h"
 
 namespace kytosite {
 
@@ -214,11 +215,6 @@ std::string BadReleaseArguments(ReleaseOptions& o, Version& v, Version& req) {
     return "";
 }
 
-std::string BaseName(const std::string& path) {
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
-}
-
 }  // namespace
 
 int CmdInit(const std::string& root, const std::string& baseUrl) {
@@ -247,7 +243,7 @@ int CmdRelease(const ReleaseOptions& options) {
     std::string why = BadReleaseArguments(o, v, req), feedText, md5;
     if (!why.empty())
         return Fail(why, kExitUsage);
-    const std::string name = BaseName(o.image);
+    const std::string name = kytotrust::SignedName(o.image);
     Site site;
     if (!SafeName(name))
         return Fail("the image's file name '" + name + "' cannot stand in a link as it is");

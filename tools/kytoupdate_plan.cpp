@@ -2,6 +2,7 @@
 // from the library's own definitions (smallupdate_plan.h) without downloading anything.
 #include <stdio.h>
 
+#include <filesystem>
 #include <string>
 #include <vector>
 
@@ -36,11 +37,6 @@ std::vector<std::string> RestartScripts(const SmallUpdate& u, int type, bool& li
     return scripts;
 }
 
-std::string BaseName(const std::string& path) {
-    const size_t slash = path.rfind('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
-}
-
 Json::Value StringArray(const std::vector<std::string>& items) {
     Json::Value array(Json::arrayValue);
     for (const std::string& item : items)
@@ -52,8 +48,9 @@ Json::Value StringArray(const std::vector<std::string>& items) {
 Json::Value ServiceEntry(const std::string& path) {
     Json::Value s(Json::objectValue);
     std::string section, key;
-    s["script"] = BaseName(path);
-    s["known"] = UpdateUtil::GetServiceNameSectionKey(BaseName(path), section, key) == 1;
+    s["script"] = std::filesystem::path(path).filename().string();
+    s["known"] = UpdateUtil::GetServiceNameSectionKey(
+                     std::filesystem::path(path).filename().string(), section, key) == 1;
     s["section"] = section;
     s["key"] = key;
     return s;

@@ -22,6 +22,7 @@
 #include "smallupdate_plan.h"
 #include "update_cpputil.h"
 #include "vyxupdate.h"
+#include "scoped.h"
 
 namespace kytoupdate {
 
@@ -79,7 +80,7 @@ std::string PatchListAddress(const SmallUpdate& checked) {
 // The patch list fetched again with its signature, verified, and read as the library
 // reads it: it must yield the record that was downloaded.  "" or the reason.
 std::string CheckPatchList(const SmallUpdate& checked) {
-    const TempFolder tmp;
+    const kyto::ScopedTempDir tmp("/tmp/kytoupdate-trust.XXXXXX");
     const std::string url = PatchListAddress(checked);
     std::string why;
     if (!tmp.Made())
@@ -123,11 +124,6 @@ bool FetchInto(const std::string& url, const std::string& folder) {
     return SmallUpdate::ExecWgetP(url, folder);
 }
 
-std::string BaseName(const std::string& link) {
-    const size_t slash = link.rfind('/');
-    return slash == std::string::npos ? link : link.substr(slash + 1);
-}
-
 bool VerifyIn(const std::string& folder, const std::string& name, std::string& why) {
     const std::string path = folder + "/" + name;
     if (kytotrust::VerifyFile(TrustedKeys().keys, path, path + kSigSuffix, name, why))
@@ -152,17 +148,6 @@ int Refuse(const std::string& why, const Removal& removal) {
     return Fail(text, kExitRefused);
 }
 
-TempFolder::TempFolder(const char* pattern) {
-    std::string name = pattern;
-    if (mkdtemp(&name[0]) != nullptr)
-        path_ = name;
-}
-
-TempFolder::~TempFolder() {
-    if (!path_.empty())
-        UpdateUtil::RemoveFolder(path_);
-}
-
 int TrustDownload(const SystemUpdate& su) {
     if (su.m_updateType == UpdateUtil::PATCH_TYPE_VYX)
         return TrustRelease(su.m_vyxUpdate);
@@ -181,7 +166,7 @@ int TrustDownload(const SystemUpdate& su) {
         if (!why.empty())
             break;
         FetchInto(link + kSigSuffix, removal.debDir);
-        VerifyIn(removal.debDir, BaseName(link), why);
+        VerifyIn(removal.debDir, kytotrust::SignedName(link), why);
     }
     return why.empty() ? -1 : Refuse(why, removal);
 }

@@ -33,8 +33,6 @@ int TrustPackageFolder(const SmallUpdate& u);
 // Fetches url into folder under its base name with the library's own fetch; false when the
 // server had nothing (the file is then absent).
 bool FetchInto(const std::string& url, const std::string& folder);
-// The last part of a link or path.
-std::string BaseName(const std::string& link);
 
 // ---- Shared by kytoupdate_trust.cpp and kytoupdate_trust_release.cpp ----
 
@@ -58,20 +56,6 @@ struct Removal {
 };
 // Removes the download, says why on standard error and in the system log; kExitRefused.
 int Refuse(const std::string& why, const Removal& removal);
-
-// A private folder under /tmp, removed with its content.
-class TempFolder {
-  public:
-    explicit TempFolder(const char* pattern = "/tmp/kytoupdate-trust.XXXXXX");
-    ~TempFolder();
-    TempFolder(const TempFolder&) = delete;
-    TempFolder& operator=(const TempFolder&) = delete;
-    bool Made() const { return !path_.empty(); }
-    const std::string& Path() const { return path_; }
-
-  private:
-    std::string path_;
-};
 
 // The full release's half of TrustDownload.
 int TrustRelease(const VyxUpdate& checked);

@@ -40,10 +40,10 @@ std::string TextMember(const Json::Value& info, const char* key) {
 
 // The image against "<link>.minisig", fetched into a private folder.  "" or the reason.
 std::string CheckImage(const Image& image) {
-    const TempFolder tmp;
+    const kyto::ScopedTempDir tmp("/tmp/kytoupdate-trust.XXXXXX");
     if (!tmp.Made())
         return "cannot make a temporary folder";
-    const std::string name = BaseName(image.release->link);
+    const std::string name = kytotrust::SignedName(image.release->link);
     FetchInto(std::string(image.release->link) + ".minisig", tmp.Path());
     std::string why;
     if (kytotrust::VerifyFile(TrustedKeys().keys, image.path, tmp.Path() + "/" + name + ".minisig",
@@ -70,11 +70,12 @@ bool FeedOffers(const Image& image) {
 // The feed fetched again with its signature, verified, then read by the library's feed
 // reader on its fixed path (removed afterwards).  "" or the reason.
 std::string CheckFeed(const std::vector<Image>& images) {
-    const TempFolder tmp("/var/run/kytoupdate-feed.XXXXXX");  // same file system as kyto::kRssFile
+    const kyto::ScopedTempDir tmp(
+        "/var/run/kytoupdate-feed.XXXXXX");  // same file system as kyto::kRssFile
     if (!tmp.Made())
         return "cannot make a temporary folder";
     const std::string url = KytoConf().Def("rss_server", kyto::kDefaultRssServer);
-    const std::string name = BaseName(url);
+    const std::string name = kytotrust::SignedName(url);
     FetchInto(url, tmp.Path());
     FetchInto(url + ".minisig", tmp.Path());
     std::string why;

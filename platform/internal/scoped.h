@@ -14,6 +14,7 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <utility>
@@ -90,6 +91,28 @@ class ScopedUnlink {
     ScopedUnlink& operator=(const ScopedUnlink&) = delete;
     void release() { path_.clear(); }
     const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+// A private folder (mode 0700) made from a mkdtemp pattern ("/tmp/name.XXXXXX"), removed
+// with everything in it when it goes away.
+class ScopedTempDir {
+  public:
+    explicit ScopedTempDir(std::string pattern) {
+        if (::mkdtemp(&pattern[0]) != nullptr)
+            path_ = std::move(pattern);
+    }
+    ~ScopedTempDir() {
+        std::error_code ignored;
+        if (!path_.empty())
+            std::filesystem::remove_all(path_, ignored);
+    }
+    ScopedTempDir(const ScopedTempDir&) = delete;
+    ScopedTempDir& operator=(const ScopedTempDir&) = delete;
+    bool Made() const { return !path_.empty(); }
+    const std::string& Path() const { return path_; }
 
   private:
     std::string path_;

@@ -72,6 +72,11 @@ bool GenerateKeyPair(const std::string& pubPath, const std::string& secPath,
 bool LoadSecretKey(const std::string& path, const std::string& password, SecretKey& key,
                    std::string& why);
 
+// The name a published file is signed and checked under: the last part of its address or
+// path ("http://h/debs/a_1-5644-s1_all.deb" and "/site/debs/a_1-5644-s1_all.deb" give
+// "a_1-5644-s1_all.deb"), so that a signed file served under another name is refused.
+std::string SignedName(const std::string& urlOrPath);
+
 // Signs a file under the name it is published as: sigText is the whole signature file, with
 // the trusted comment "timestamp:<unix time>\tfile:<signedName>\thashed".
 bool SignFile(const SecretKey& key, const std::string& filePath, const std::string& signedName,

@@ -10,6 +10,11 @@
 
 namespace kytotrust {
 
+std::string SignedName(const std::string& urlOrPath) {
+    const size_t slash = urlOrPath.rfind('/');
+    return slash == std::string::npos ? urlOrPath : urlOrPath.substr(slash + 1);
+}
+
 using namespace detail;
 
 namespace {
