@@ -38,16 +38,20 @@ bool OpenSite(const std::string& root, Site& site, std::string& why);
 // A name that may stand in a path, a link and a feed line as it is: letters, digits and
 // ". _ + - ~", not "." or "..".
 bool SafeName(const std::string& name);
+// A base for owners of something on disk: never copied, so that one owner cleans up.
+struct NonCopyable {
+    NonCopyable() = default;
+    NonCopyable(const NonCopyable&) = delete;
+    NonCopyable& operator=(const NonCopyable&) = delete;
+};
+
 // Creates the folder and its parents (mode 0755), naming those it made in *made.
 bool MakeFolders(const std::string& path, std::string& why,
                  std::vector<std::string>* made = nullptr);
 // Folders made for a command, removed again (when empty) unless the command kept them.
-class MadeFolders {
+class MadeFolders : NonCopyable {
   public:
-    MadeFolders() = default;
     ~MadeFolders();
-    MadeFolders(const MadeFolders&) = delete;
-    MadeFolders& operator=(const MadeFolders&) = delete;
     bool Make(const std::string& path, std::string& why) { return MakeFolders(path, why, &made_); }
     void Keep() { made_.clear(); }
 
@@ -59,12 +63,9 @@ bool Exists(const std::string& path);
 
 // A new file written beside dest (a hidden temporary file in the same folder) and renamed
 // over dest by Commit; removed when it goes away uncommitted.
-class StagedFile {
+class StagedFile : NonCopyable {
   public:
-    StagedFile() = default;
     ~StagedFile();
-    StagedFile(const StagedFile&) = delete;
-    StagedFile& operator=(const StagedFile&) = delete;
 
     bool Open(const std::string& dest, std::string& why);
     bool Write(const std::string& text, std::string& why);
