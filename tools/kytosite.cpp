@@ -32,7 +32,8 @@ void AddInitRelease(CLI::App& app, Options& o) {
     rel->add_option("IMAGE", r.image, "The release image")->required()->check(CLI::ExistingFile);
     rel->add_option("--version", r.version, "The release, MAJOR.MINOR-BUILD")->required();
     rel->add_option("--model", r.models, "A model identity the image is for (repeatable)")
-        ->required();
+        ->required()
+        ->allow_extra_args(false);
     rel->add_option("--phase", r.phase, "Build phase (default GM)");
     rel->add_option("--date", r.date, "Build date YYYY/MM/DD (default today)");
     rel->add_option("--requires", r.requirement,
@@ -45,7 +46,9 @@ void AddFix(CLI::App& app, FixOptions& f) {
     fix->add_option("--build", f.build, "The build the fix is for")
         ->required()
         ->check(CLI::PositiveNumber);
-    fix->add_option("--model", f.models, "A model identity (repeatable)")->required();
+    fix->add_option("--model", f.models, "A model identity (repeatable)")
+        ->required()
+        ->allow_extra_args(false);
     fix->add_option("--fix", f.fix, "The fix number")->required()->check(CLI::PositiveNumber);
     fix->add_option("--smallupdate", f.smallupdate, "The small-update package")
         ->check(CLI::ExistingFile);
@@ -54,8 +57,13 @@ void AddFix(CLI::App& app, FixOptions& f) {
     fix->add_flag("--config", f.config, "Ask for a configuration update");
     CLI::Option* reboot = fix->add_flag("--reboot", f.reboot, "The fix needs a reboot");
     CLI::Option* all = fix->add_flag("--restart-all", f.restartAll, "Restart all services");
-    CLI::Option* svc = fix->add_option("--restart-service", f.services, "A service to restart");
-    CLI::Option* pkg = fix->add_option("--restart-package", f.packages, "A package to restart");
+    // One name per option, so that a package file after it is never taken for a name.
+    CLI::Option* svc =
+        fix->add_option("--restart-service", f.services, "A service to restart (repeatable)")
+            ->allow_extra_args(false);
+    CLI::Option* pkg =
+        fix->add_option("--restart-package", f.packages, "A package to restart (repeatable)")
+            ->allow_extra_args(false);
     reboot->excludes(all)->excludes(svc)->excludes(pkg);
     all->excludes(svc)->excludes(pkg);
     fix->add_option("DEB", f.debs, "Further packages")->check(CLI::ExistingFile);

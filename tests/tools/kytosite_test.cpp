@@ -78,8 +78,9 @@ class KytositeTest : public UpdateServerTest {
         Outcome r = Site(base + "--fix 1 --smallupdate " + Deb("kyto-su", "5.2") + " " +
                          Deb("kyto-fix-a") + " --restart-service S01iptables.sh");
         ASSERT_EQ(0, r.rc) << r.err;
-        r = Site(base + "--fix 2 --smallupdate " + Deb("kyto-su", "5.2.1") + " " +
-                 Deb("kyto-fix-b", "2.0-5644-s2") + " --restart-package DemoApp");
+        // A package after a restart name is a package, not a second name.
+        r = Site(base + "--fix 2 --smallupdate " + Deb("kyto-su", "5.2.1") +
+                 " --restart-package DemoApp " + Deb("kyto-fix-b", "2.0-5644-s2"));
         ASSERT_EQ(0, r.rc) << r.err;
     }
     std::string root, image;
