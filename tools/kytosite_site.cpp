@@ -24,20 +24,6 @@ std::string Errno(const std::string& what) {
     return what + ": " + strerror(errno);
 }
 
-// Writes all of it, retrying short writes and interruptions.
-bool WriteAll(int fd, const char* data, size_t size) {
-    while (size > 0) {
-        const ssize_t n = ::write(fd, data, size);
-        if (n < 0 && errno == EINTR)
-            continue;
-        if (n <= 0)
-            return false;
-        data += n;
-        size -= static_cast<size_t>(n);
-    }
-    return true;
-}
-
 // The percentage display of a long copy: on standard error, only on a terminal.
 class Progress {
   public:
@@ -161,7 +147,7 @@ bool StagedFile::Open(const std::string& dest, std::string& why) {
 }
 
 bool StagedFile::Write(const void* data, size_t size, std::string& why) {
-    if (!WriteAll(fd_, static_cast<const char*>(data), size)) {
+    if (!kyto::WriteAll(fd_, data, size)) {
         why = Errno("cannot write " + temp_);
         return false;
     }

@@ -160,6 +160,26 @@ struct LineBuffer {
     ssize_t Read(FILE* f) { return getline(&data, &size, f); }
 };
 
+// Writes all of data, retrying short writes and interruptions.  False at the first error
+// (errno set) or a write that writes nothing.
+inline bool WriteAll(int fd, const void* data, size_t size) {
+    const char* p = static_cast<const char*>(data);
+    while (size > 0) {
+        const ssize_t n = ::write(fd, p, size);
+        if (n < 0 && errno == EINTR)
+            continue;
+        if (n <= 0)
+            return false;
+        p += n;
+        size -= static_cast<size_t>(n);
+    }
+    return true;
+}
+
+inline bool WriteAll(int fd, const std::string& data) {
+    return WriteAll(fd, data.data(), data.size());
+}
+
 }  // namespace kyto
 #pragma GCC visibility pop
 

@@ -40,20 +40,6 @@ bool ValidLineFormat(const char* fmt) {
     return strings == 2;
 }
 
-bool WriteAll(int fd, const std::string& data) {
-    size_t done = 0;
-    while (done < data.size()) {
-        ssize_t n = ::write(fd, data.data() + done, data.size() - done);
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
-            return false;
-        }
-        done += static_cast<size_t>(n);
-    }
-    return true;
-}
-
 // Folder and base name of path ("." for a bare name).
 void SplitPath(const std::string& path, std::string* dir, std::string* base) {
     size_t slash = path.rfind('/');
@@ -365,8 +351,8 @@ bool ReplaceFile(const char* path, const std::string& content, mode_t mode) {
         return false;
     }
     ScopedUnlink cleanup(tmpl);
-    if (::fchmod(fd.get(), mode) != 0 || !WriteAll(fd.get(), content) || ::fsync(fd.get()) != 0 ||
-        ::close(fd.release()) != 0 || ::rename(tmpl.c_str(), path) != 0) {
+    if (::fchmod(fd.get(), mode) != 0 || !kyto::WriteAll(fd.get(), content) ||
+        ::fsync(fd.get()) != 0 || ::close(fd.release()) != 0 || ::rename(tmpl.c_str(), path) != 0) {
         KYTO_FAIL(KYTO_ERR_FILE_WRITE);
         return false;
     }

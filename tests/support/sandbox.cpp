@@ -1,5 +1,6 @@
 // Shared test helpers for code that runs inside the kyto-sandbox root.
 #include "sandbox.h"
+#include "scoped.h"
 
 #include <dirent.h>
 #include <errno.h>
@@ -158,19 +159,6 @@ std::optional<std::string> FlushSyslog() {
     return std::nullopt;
 }
 
-bool WriteAll(int fd, const std::string& data) {
-    size_t done = 0;
-    while (done < data.size()) {
-        ssize_t n = write(fd, data.data() + done, data.size() - done);
-        if (n < 0 && errno == EINTR)
-            continue;
-        if (n <= 0)
-            return false;
-        done += static_cast<size_t>(n);
-    }
-    return true;
-}
-
 void MakeDirs(const std::string& path) {
     for (size_t pos = 1; pos <= path.size(); ++pos) {
         if (pos != path.size() && path[pos] != '/')
@@ -320,7 +308,7 @@ void WriteFile(const std::string& path, const std::string& content, mode_t mode)
         ADD_FAILURE() << "cannot write " << path << ": " << strerror(errno);
         return;
     }
-    bool ok = WriteAll(fd, content) && fchmod(fd, mode) == 0;
+    bool ok = kyto::WriteAll(fd, content) && fchmod(fd, mode) == 0;
     int err = errno;
     close(fd);
     if (!ok)

@@ -20,6 +20,7 @@
 #include <json/json.h>
 
 #include "sandbox.h"
+#include "scoped.h"
 
 namespace kytotest {
 namespace {
@@ -35,20 +36,6 @@ void MakeParents(const std::string& path) {
 
 int RemoveEntry(const char* path, const struct stat*, int, struct FTW*) {
     return remove(path);
-}
-
-bool WriteAllFd(int fd, const char* data, size_t size) {
-    while (size > 0) {
-        ssize_t n = write(fd, data, size);
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
-            return false;
-        }
-        data += n;
-        size -= static_cast<size_t>(n);
-    }
-    return true;
 }
 
 Json::Value ReadJson(const std::string& path) {
@@ -142,7 +129,7 @@ void UpdateServer::PutFile(const std::string& urlPath, const std::string& conten
     MakeParents(local);
     int fd = open(local.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
     ASSERT_GE(fd, 0) << local << ": " << strerror(errno);
-    bool ok = WriteAllFd(fd, content.data(), content.size());
+    bool ok = kyto::WriteAll(fd, content.data(), content.size());
     close(fd);
     ASSERT_TRUE(ok) << "write " << local;
 }
@@ -168,7 +155,7 @@ std::string UpdateServer::PutFileOfSize(const std::string& urlPath, unsigned lon
     for (unsigned long long done = 0, index = 0; ok && done < bytes; ++index) {
         memcpy(&block[0], &index, sizeof(index));
         size_t n = static_cast<size_t>(std::min<unsigned long long>(block.size(), bytes - done));
-        ok = WriteAllFd(fd, block.data(), n);
+        ok = kyto::WriteAll(fd, block.data(), n);
         done += n;
     }
     close(fd);

@@ -12,6 +12,7 @@
 #include <sodium.h>
 
 #include "kytotrust.h"
+#include "scoped.h"
 
 namespace kytotrust {
 
@@ -28,11 +29,6 @@ std::string KeyIdHex(const uint8_t id[8]) {
 
 namespace detail {
 
-Fd::~Fd() {
-    if (fd_ >= 0)
-        close(fd_);
-}
-
 Wipe::~Wipe() {
     sodium_memzero(p_, n_);
 }
@@ -46,9 +42,9 @@ bool SodiumReady(std::string& why) {
 }
 
 bool ReadSmallFile(const std::string& path, std::string& text, std::string& why, int* errnoOut) {
-    Fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
+    kyto::UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
     struct stat st;
-    if (!fd.ok() || fstat(fd.get(), &st) != 0) {
+    if (!fd.valid() || fstat(fd.get(), &st) != 0) {
         if (errnoOut)
             *errnoOut = errno;
         why = "cannot read " + path + ": " + strerror(errno);
@@ -63,9 +59,7 @@ bool ReadSmallFile(const std::string& path, std::string& text, std::string& why,
     text.clear();
     char buf[4096];
     for (;;) {
-        const ssize_t n = read(fd.get(), buf, sizeof buf);
-        if (n < 0 && errno == EINTR)
-            continue;
+        const ssize_t n = kyto::ReadRetry(fd.get(), buf, sizeof buf);
         if (n < 0) {
             if (errnoOut)
                 *errnoOut = errno;
@@ -83,28 +77,15 @@ bool ReadSmallFile(const std::string& path, std::string& text, std::string& why,
     return true;
 }
 
-static bool WriteAll(int fd, const std::string& text) {
-    size_t done = 0;
-    while (done < text.size()) {
-        const ssize_t n = write(fd, text.data() + done, text.size() - done);
-        if (n < 0 && errno == EINTR)
-            continue;
-        if (n <= 0)
-            return false;
-        done += static_cast<size_t>(n);
-    }
-    return true;
-}
-
 bool WriteBeside(const std::string& path, const std::string& text, unsigned mode, bool noReplace,
                  std::string& why) {
     std::string tmp = path + ".tmp.XXXXXX";
-    Fd fd(mkostemp(&tmp[0], O_CLOEXEC));
-    if (!fd.ok()) {
+    kyto::UniqueFd fd(mkostemp(&tmp[0], O_CLOEXEC));
+    if (!fd.valid()) {
         why = "cannot create a file beside " + path + ": " + strerror(errno);
         return false;
     }
-    bool ok = fchmod(fd.get(), mode) == 0 && WriteAll(fd.get(), text) && fsync(fd.get()) == 0;
+    bool ok = fchmod(fd.get(), mode) == 0 && kyto::WriteAll(fd.get(), text) && fsync(fd.get()) == 0;
     if (ok)
         ok = noReplace ? link(tmp.c_str(), path.c_str()) == 0
                        : rename(tmp.c_str(), path.c_str()) == 0;

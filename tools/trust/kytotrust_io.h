@@ -1,4 +1,4 @@
-// Shared by the parts of kytotrust: descriptors, small files, base64 and the two-line blocks
+// Shared by the parts of kytotrust: small files, base64 and the two-line blocks
 // the key and signature files are made of.
 #ifndef KYTOTRUST_IO_H
 #define KYTOTRUST_IO_H
@@ -11,20 +11,6 @@
 
 namespace kytotrust {
 namespace detail {
-
-// Owns one descriptor.
-class Fd {
-  public:
-    explicit Fd(int fd = -1) : fd_(fd) {}
-    Fd(const Fd&) = delete;
-    Fd& operator=(const Fd&) = delete;
-    ~Fd();
-    int get() const { return fd_; }
-    bool ok() const { return fd_ >= 0; }
-
-  private:
-    int fd_;
-};
 
 // Wipes a buffer when it goes away.
 class Wipe {

@@ -10,14 +10,15 @@
 
 #include "kytotrust.h"
 #include "kytotrust_io.h"
+#include "scoped.h"
 
 namespace kytotrust {
 
 using namespace detail;
 
 bool detail::HashFile(const std::string& path, uint8_t hash[64], std::string& why) {
-    Fd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
-    if (!fd.ok()) {
+    kyto::UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
+    if (!fd.valid()) {
         why = "cannot read " + path + ": " + strerror(errno);
         return false;
     }
@@ -26,9 +27,7 @@ bool detail::HashFile(const std::string& path, uint8_t hash[64], std::string& wh
     static constexpr size_t kBlock = 1 << 16;
     std::string buf(kBlock, '\0');
     for (;;) {
-        const ssize_t n = read(fd.get(), &buf[0], kBlock);
-        if (n < 0 && errno == EINTR)
-            continue;
+        const ssize_t n = kyto::ReadRetry(fd.get(), &buf[0], kBlock);
         if (n < 0) {
             why = "cannot read " + path + ": " + strerror(errno);
             return false;
