@@ -88,8 +88,9 @@ download() {
     t0=$(now)
     "$KYTOUPDATE" download >/tmp/download.out 2>/tmp/download.err || rc=$?
     since "$t0"
-    [ $rc = 0 ] && grep -q "^downloaded vyx " /tmp/download.out ||
+    if [ $rc != 0 ] || ! grep -q "^downloaded vyx " /tmp/download.out; then
         fail "download ($1) failed with $rc: $(cat /tmp/download.out /tmp/download.err)"
+    fi
     # Without the folder the driver says that nothing is checked; with it, it must not.
     if grep -q "signatures are not checked" /tmp/download.err; then
         [ "$1" = none ] || fail "the trust folder was not used: $(cat /tmp/download.err)"
