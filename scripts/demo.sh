@@ -3,13 +3,15 @@
 #
 #   bash scripts/demo.sh
 #
-# Installs the packages it needs, builds kytoupdate and the sandbox launcher in build/, then,
-# inside a disposable appliance root (build/tests/kyto-sandbox: overlay over "/", own
-# loopback network), starts a sample update server (nginx on 127.0.0.1) with a release feed,
-# a patch list and real packages, and drives a small update (check, download, status,
-# plan, apply) and then a full release (check, download) with kytoupdate.  Everything the
-# demo writes inside the appliance root vanishes with it; afterwards the host's appliance
-# paths are checked.  KYTO_DEMO_IMAGE_MB sets the release image's size (default 96),
+# Installs the packages it needs, builds kytoupdate, kytosite and the sandbox launcher in
+# build/, then, inside a disposable appliance root (build/tests/kyto-sandbox: overlay over
+# "/", own loopback network): makes a sample update site with kytosite (two fixes of real
+# packages), signs it with a demo key made on the spot, serves it with nginx on 127.0.0.1
+# and checks it with kytosite check; trusts the key on the appliance and drives a small
+# update (check, download, status, plan, apply) with kytoupdate, shows a package altered on
+# the server refused, then publishes and downloads a full release (check, download).
+# Everything the demo writes inside the appliance root vanishes with it; afterwards the
+# host's appliance paths are checked.  KYTO_DEMO_IMAGE_MB sets the release image's size (default 96),
 # KYTO_BUILD_DIR the build folder.
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -22,7 +24,7 @@ BUILD=${KYTO_BUILD_DIR:-$ROOT/build}  # another build folder: KYTO_BUILD_DIR=/pa
 HOST_PATHS=(/autoupd@te.info /passive_upd@te.info /etc.defaults /smallupd@te /@smallupd@te_deb
     /.upgrade_vol /usr/kyto /volume1 /srv/kyto-demo /var/run/downloadVYX.status
     /var/run/applySmallUpd@te.status /var/run/downloadVYX.pid /var/log/kytoupdate.log
-    /var/log/dpkg_upgrade.log /var/log/kyto-calls.log)
+    /var/log/dpkg_upgrade.log /var/log/kyto-calls.log /etc/kytoupdate)
 snapshot_host() {
     local d p
     for p in "${HOST_PATHS[@]}"; do
@@ -51,10 +53,11 @@ else
 fi
 BEFORE=$(snapshot_host)
 
-echo "== build kytoupdate and the sandbox launcher in $BUILD"
+echo "== build kytoupdate, kytosite and the sandbox launcher in $BUILD"
 cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_BUILD_TESTS=ON -DKYTO_WERROR=ON \
     >/dev/null
-if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kyto-sandbox >"$BUILD/demo-build.log" 2>&1; then
+if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kytosite kyto-sandbox \
+    >"$BUILD/demo-build.log" 2>&1; then
     tail -n 30 "$BUILD/demo-build.log"
     echo "demo.sh: FAILED (build; log: $BUILD/demo-build.log)"
     exit 1

@@ -1,6 +1,7 @@
 #!/bin/bash
 # Peak memory of "kytoupdate download" during a 1 GiB release download from the sample
-# server, against bare processes that load the same libraries.  Run inside the sandbox:
+# server (its site made with kytosite), against bare processes that load the same
+# libraries.  Run inside the sandbox (after scripts/demo.sh's build):
 #   build/tests/kyto-sandbox scripts/demo/memory.sh BUILD_DIR [MiB]
 # Prints the peak resident set (VmHWM) of every kytoupdate process (the display and the
 # download process it forks) and of wget, sampled every 20 ms, and of the bare processes.
@@ -13,7 +14,11 @@ BASE=http://127.0.0.1:$PORT
 SITE=/srv/kyto-demo
 STATE=/run/kyto-demo-nginx
 
-"$HERE/make_site.sh" $SITE $BASE feed-release "$MB"
+# The release image, published with kytosite (unsigned: no trust folder on this appliance).
+head -c $((MB * 1048576)) /dev/urandom >/tmp/VYX_5.2-5700.img
+"$BUILD/tools/kytosite" init $SITE --base-url $BASE >/dev/null
+"$BUILD/tools/kytosite" release $SITE /tmp/VYX_5.2-5700.img --version 5.2-5700 --model demo_model
+rm /tmp/VYX_5.2-5700.img
 mkdir -p $STATE /volume1
 sed -e "s|@SITE@|$SITE|; s|@PORT@|$PORT|; s|@STATE@|$STATE|g; s|@PKG_RATE@|0|; s|@IMG_RATE@|0|" \
     "$HERE/nginx.conf.in" >$STATE/nginx.conf

@@ -1,7 +1,8 @@
 // kytoupdate with the vendor's key in /etc/kytoupdate/trusted.d: each kind of bad signature
 // at each place (patch list, package, image, feed) is refused with nothing usable left; a
 // package altered in the package folder is refused at apply; a local archive must carry its
-// signatures; signed updates pass; without a trust folder, one notice and nothing checked.
+// signatures; signed updates pass, also when the minisign tool made the key and signed;
+// without a trust folder, one notice and nothing checked.
 #include <sys/stat.h>
 
 #include <optional>
@@ -136,6 +137,24 @@ TEST_F(KytoupdateTrustTest, SignedUpdatesPassAndAPackageAlteredAfterwardsIsRefus
     SignedSite(true);
     ExpectDownloaded(std::string("vyx VYX 5.2-5700 ") + kImage + "\n");
     EXPECT_EQ(Md5Of(server->Root() + "/img/vyx.img"), Md5Of(kImage));
+}
+
+TEST_F(KytoupdateTrustTest, WhatTheMinisignToolSignsPasses) {
+    // The vendor's key made by minisign (no password) and trusted alone; every file signed
+    // by minisign -S under its own name.
+    RemoveTree(std::string(kTrustDir) + "/vendor.pub");
+    ASSERT_EQ(0, Shell("minisign -G -W -p /tmp/keys/m.pub -s /tmp/keys/m.key >/dev/null && cp "
+                       "/tmp/keys/m.pub " +
+                       std::string(kTrustDir)));
+    server->PutFile(kFeed, FeedDocument(""));
+    PublishSmallFix(*server);
+    for (const std::string& f :
+         {std::string(kFeed), ListPath(), "/debs/" + SmallFixDeb(), std::string(kSu)})
+        ASSERT_EQ(0,
+                  Shell("minisign -S -s /tmp/keys/m.key -m " + server->Root() + f + " >/dev/null"));
+    ExpectDownloaded("smallupdate VYX 5.2-5644 update 1\n");
+    ExpectRuns({{"apply", 0, "applied VYX 5.2-5644 update 1\n", "starting services"}});
+    EXPECT_TRUE(DpkgInstalled("kyto-tool-fix"));
 }
 
 TEST_F(KytoupdateTrustTest, ASignedListOrFeedThatChangedDuringTheDownloadIsRefused) {
