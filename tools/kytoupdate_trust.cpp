@@ -3,6 +3,7 @@
 // image and feed are checked in kytoupdate_trust_release.cpp.
 #include "kytoupdate_trust.h"
 
+#include <fcntl.h>
 #include <glob.h>
 #include <stdlib.h>
 #include <sys/stat.h>
@@ -121,7 +122,15 @@ const Trust& TrustedKeys() {
 }
 
 bool FetchInto(const std::string& url, const std::string& folder) {
-    return SmallUpdate::ExecWgetP(url, folder);
+    // wget's log (its standard error) belongs to a download a person watches; a signature
+    // or a list fetched again for checking is not one, so the log goes to /dev/null.
+    const kyto::UniqueFd saved(fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 0));
+    const kyto::UniqueFd null(open("/dev/null", O_WRONLY | O_CLOEXEC));
+    const bool quiet = saved.valid() && null.valid() && dup2(null.get(), STDERR_FILENO) >= 0;
+    const bool fetched = SmallUpdate::ExecWgetP(url, folder);
+    if (quiet)
+        dup2(saved.get(), STDERR_FILENO);
+    return fetched;
 }
 
 bool VerifyIn(const std::string& folder, const std::string& name, std::string& why) {

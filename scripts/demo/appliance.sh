@@ -30,16 +30,9 @@ run() {
     printf '%s# %s%s\n' "$C" "${*#"$BUILD/tools/"}" "$N"
     "$@"
 }
-# kytoupdate download passes on wget's own log of each signature fetch on standard error;
-# the demo drops those lines (and only those) so that its notes and refusals stand out.
-WGET_LOG='/^(--[0-9-]{10} [0-9:]{8}--  |Connecting to |HTTP request sent|Length: |Saving to: )/d
-/^ +0K |^[0-9-]{10} [0-9:]{8} \(.*\) - .* saved \[|^$/d'
 download() {
     printf '%s# kytoupdate download%s\n' "$C" "$N"
-    # Standard output stays where it was (a terminal shows the progress bar); only
-    # standard error goes through the filter.
-    { "$KYTOUPDATE" download 2>&1 1>&3 3>&- | sed -u -E "$WGET_LOG" >&2 3>&-; } 3>&1 ||
-        return "${PIPESTATUS[0]}"
+    "$KYTOUPDATE" download
 }
 stop_server() {
     if [ -f $STATE/nginx.pid ]; then kill "$(cat $STATE/nginx.pid)" 2>/dev/null || true; fi

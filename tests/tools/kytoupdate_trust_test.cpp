@@ -96,6 +96,7 @@ class KytoupdateTrustTest : public KytoupdateTest {
         const Outcome r = Cmd("download");
         EXPECT_EQ(0, r.rc) << r.err;
         EXPECT_TRUE(Has(r.out, "downloaded " + what));
+        EXPECT_FALSE(Has(r.err, "HTTP request sent")) << "wget's log of the checking fetches";
     }
 };
 
