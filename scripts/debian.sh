@@ -78,6 +78,13 @@ if ! (cd "$SRC" && dpkg-checkbuilddeps) 2>/dev/null; then
     apt-get build-dep -y -qq "$SRC" >/dev/null
 fi
 
+step "source package (for lintian)"
+# The source package as a vendor's build system would make it: the tree without debian/ as
+# the upstream tarball, debian/ beside it.
+tar -C "$TMP" --exclude="${SRC##*/}/debian" -czf "$TMP/libkytoinstallcpp_${VERSION%-*}.orig.tar.gz" \
+    "${SRC##*/}"
+(cd "$TMP" && dpkg-source -b "${SRC##*/}" >/dev/null)
+
 step "dpkg-buildpackage -us -uc -b"
 BUILD_START=$SECONDS
 if ! (cd "$SRC" && dpkg-buildpackage -us -uc -b) >"$TMP/build.log" 2>&1; then
@@ -88,10 +95,10 @@ grep -E '^dpkg-deb: building|dpkg-gensymbols' "$TMP/build.log" || true
 echo "   built in $((SECONDS - BUILD_START))s"
 CHANGES=$(ls "$TMP"/*.changes)
 
-step "lintian"
+step "lintian (the binary packages and the source package)"
 LINTIAN_START=$SECONDS
-lintian -I --pedantic --show-overrides "$CHANGES" 2>&1 | grep -v 'running with root privileges' |
-    tee "$TMP/lintian.log" || true
+lintian -I --pedantic --show-overrides "$CHANGES" "$TMP"/*.dsc 2>&1 |
+    grep -v 'running with root privileges' | tee "$TMP/lintian.log" || true
 echo "   lintian took $((SECONDS - LINTIAN_START))s"
 if grep -qE '^[EW]: ' "$TMP/lintian.log"; then
     echo "lintian reports errors or warnings" >&2
