@@ -1,7 +1,4 @@
 // auto: the scheduled auto-update job, one run at a time under a lock file.
-#include <fcntl.h>
-#include <sys/file.h>
-
 #include <string>
 
 #include "kyto_paths.h"
@@ -18,11 +15,12 @@ const char* const kAutoLock = "/var/run/kytoupdate-auto.lock";
 
 int CmdAuto() {
     // One auto-update at a time, whoever starts it (the timer, cron, a person).
-    const kyto::UniqueFd lock(open(kAutoLock, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    bool busy = false;
+    const kyto::UniqueFd lock = TryLock(kAutoLock, &busy);
+    if (busy)
+        return Fail("another automatic update is running");
     if (!lock.valid())
         return Fail(std::string("cannot open ") + kAutoLock);
-    if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0)
-        return Fail("another automatic update is running");
     CatchStopSignals();
     SystemUpdate su;
     const int rc = CheckAndDownload(su);

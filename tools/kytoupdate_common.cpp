@@ -1,6 +1,8 @@
 #include "kytoupdate_common.h"
 
+#include <fcntl.h>
 #include <stdio.h>
+#include <sys/file.h>
 #include <time.h>
 
 #include <iterator>
@@ -39,6 +41,14 @@ void Note(const std::string& text) {
 int Fail(const std::string& text, int code) {
     Note(text);
     return code;
+}
+
+kyto::UniqueFd TryLock(const char* path, bool* busy) {
+    kyto::UniqueFd lock(open(path, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    *busy = lock.valid() && flock(lock.get(), LOCK_EX | LOCK_NB) != 0;
+    if (*busy)
+        lock.reset();
+    return lock;
 }
 
 const char* RestartWord(int restartType) {

@@ -11,6 +11,7 @@
 #include <functional>
 #include <string>
 
+#include "scoped.h"
 #include "smallupdate.h"
 #include "systemupdate.h"
 
@@ -39,6 +40,10 @@ void SleepMs(long ms);
 // "kytoupdate: <text>" on standard error; Fail returns code for the caller to exit with.
 void Note(const std::string& text);
 int Fail(const std::string& text, int code = kExitFailed);
+// Takes the lock file at path without waiting; an invalid descriptor when another process
+// holds it or the file cannot be opened (*busy tells which).  The lock lasts as long as the
+// descriptor and the children forked while it is open.
+kyto::UniqueFd TryLock(const char* path, bool* busy);
 
 // Words printed for the library's numbers.
 const char* RestartWord(int restartType);

@@ -51,6 +51,9 @@ bool SmallDownloadWord(int& pct) {
     return word == "init" || word == "downloading";
 }
 
+// Held by the process of a download (and the child it forks) from start to end.
+const char* const kDownloadLock = "/var/run/kytoupdate-download.lock";
+
 // True when a download of either kind is under way (in any process).
 bool DownloadRunning() {
     int pct = 0;
@@ -217,6 +220,15 @@ int CmdCheck() {
 int CheckAndDownload(SystemUpdate& su) {
     if (DownloadRunning())
         return Fail("a download is already running (kytoupdate status, kytoupdate cancel)");
+    // A cancelled small update stops only after the package it is fetching, while its status
+    // already reads stopped: the lock, held until this download's process has ended, keeps a
+    // new download out of the package folder until then.
+    bool busy = false;
+    const kyto::UniqueFd lock = TryLock(kDownloadLock, &busy);
+    if (busy)
+        return Fail("a cancelled download is still stopping; try again in a moment");
+    if (!lock.valid())
+        return Fail(std::string("cannot open ") + kDownloadLock);
     const int rc = Check(su);
     if (rc >= 0)
         return rc;

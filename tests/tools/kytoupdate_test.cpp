@@ -181,4 +181,18 @@ TEST_F(KytoupdateTest, CancelFromASecondKytoupdateWhileAThirdWatches) {
     EXPECT_EQ(0, Wait(watch));
 }
 
+// A cancelled small update stops after the package it is fetching; until its process has
+// ended a new download is refused, so that two never write one package folder.
+TEST_F(KytoupdateTest, ANewDownloadWaitsForACancelledOneToEnd) {
+    PublishSmallFix(*server);
+    server->SlowPath("/debs/" + SmallFixDeb(), 512);
+    const pid_t first = Spawn([] { return Shell(Kyto() + " download >/dev/null 2>&1"); });
+    ASSERT_TRUE(WaitFor([&] { return !server->RequestsFor("/debs/" + SmallFixDeb()).empty(); }));
+    ExpectRuns({{"cancel", 0, "cancelled\n", ""},
+                {"download", 1, "", "a cancelled download is still stopping"}});
+    EXPECT_EQ(4, Wait(first));
+    server->SlowPath("/debs/" + SmallFixDeb(), 0);
+    EXPECT_EQ(0, Cmd("download").rc);
+}
+
 }  // namespace
