@@ -17,9 +17,9 @@
 set -euo pipefail
 
 SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
+source "$SRC/bench/bench_lib.sh"
 
 if [ "${1:-}" != "--inside" ]; then
-    source "$SRC/bench/bench_lib.sh"
     kyto_bench_enter_sandbox "$SRC/bench/small_update_bench.sh" small_update_bench "${1:-6}"
 fi
 
@@ -56,17 +56,17 @@ CONTROL
     dpkg-deb --root-owner-group -b "$root" "$SERVED/debs/${pkg}_6.1-$BUILDNUM-s1_all.deb" \
         >/dev/null
 done
+# The fix's small-update package (fetched with further packages, unpacked only for a
+# configuration update, never installed): tiny.
+SU="benchsu_6.1-$BUILDNUM-s1_all.deb"
+mkdir -p /tmp/benchpkg/su/DEBIAN
+printf 'Package: benchsu\nVersion: 6.1-%s-s1\nArchitecture: all\nMaintainer: Bench <bench@example.invalid>\nDescription: small-update package of the benchmark\n' \
+    "$BUILDNUM" >/tmp/benchpkg/su/DEBIAN/control
+dpkg-deb --root-owner-group -b /tmp/benchpkg/su "$SERVED/debs/$SU" >/dev/null
 rm -rf /tmp/benchpkg
 
-PORT_FILE=$(mktemp)
-python3 "$SRC/tests/support/update_server.py" "$SERVED" >"$PORT_FILE" &
-SERVER_PID=$!
-trap 'kill "$SERVER_PID" 2>/dev/null; wait "$SERVER_PID" 2>/dev/null || true' EXIT
-for _ in $(seq 100); do
-    [ -s "$PORT_FILE" ] && break
-    sleep 0.1
-done
-PORT=$(head -n1 "$PORT_FILE")
+kyto_bench_start_server "$SERVED"
+trap kyto_bench_stop_server EXIT
 BASE="http://127.0.0.1:$PORT"
 
 # The patch list: one fix (1) naming the 50 packages.
@@ -81,6 +81,7 @@ mkdir -p "$LIST_DIR"
             "$pkg" "$BUILDNUM"
         sep=","
     done
+    printf ',{"name":"smallupdate","url":"%s/debs/%s"}' "$BASE" "$SU"
     printf ']}]}\n'
 } >"$LIST_DIR/VYX-Security.json"
 echo "small_info_path=\"$BASE/smallupdate\"" >>/etc.defaults/kytoinfo.conf
@@ -109,6 +110,7 @@ run_plain() {
         file="${pkg}_6.1-$BUILDNUM-s1_all.deb"
         wget -O "$PLAIN/$file" "$BASE/debs/$file" 2>>/tmp/plain-wget.log
     done
+    wget -O "$PLAIN/$SU" "$BASE/debs/$SU" 2>>/tmp/plain-wget.log
     t1=$(now)
     for pkg in "${NAMES[@]}"; do
         dpkg -i "$PLAIN/${pkg}_6.1-$BUILDNUM-s1_all.deb" >>/tmp/plain-dpkg.log 2>&1
