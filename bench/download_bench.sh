@@ -13,9 +13,9 @@
 set -euo pipefail
 
 SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
+source "$SRC/bench/bench_lib.sh"
 
 if [ "${1:-}" != "--inside" ]; then
-    source "$SRC/bench/bench_lib.sh"
     kyto_bench_enter_sandbox "$SRC/bench/download_bench.sh" vyx_download_bench "${1:-5}"
 fi
 
@@ -32,15 +32,8 @@ mkdir -p /srv/bench/images /srv/bench/autoupdate
 head -c $((SIZE_MIB << 20)) /dev/urandom >/srv/bench/images/vyx.img
 MD5=$(openssl md5 /srv/bench/images/vyx.img | awk '{print $2}')
 
-PORT_FILE=$(mktemp)
-python3 "$SRC/tests/support/update_server.py" /srv/bench >"$PORT_FILE" &
-SERVER_PID=$!
-trap 'kill "$SERVER_PID" 2>/dev/null; wait "$SERVER_PID" 2>/dev/null || true' EXIT
-for _ in $(seq 100); do
-    [ -s "$PORT_FILE" ] && break
-    sleep 0.1
-done
-PORT=$(head -n1 "$PORT_FILE")
+kyto_bench_start_server /srv/bench
+trap kyto_bench_stop_server EXIT
 URL="http://127.0.0.1:$PORT/images/vyx.img"
 
 cat >/srv/bench/autoupdate/genRSS.php <<FEED

@@ -19,6 +19,7 @@
 set -euo pipefail
 
 SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
+source "$SRC/bench/bench_lib.sh"
 
 if [ "${1:-}" != "--inside" ]; then
     WHAT=${1:-all}
@@ -28,7 +29,6 @@ if [ "${1:-}" != "--inside" ]; then
         exit 2
         ;;
     esac
-    source "$SRC/bench/bench_lib.sh"
     kyto_bench_enter_sandbox "$SRC/bench/reader_bench.sh" \
         "status_poll_bench feed_bench feed_reader_check" "$WHAT" "$@"
 fi
@@ -51,16 +51,10 @@ if [ "$WHAT" != feed ]; then
     truncate -s 1G /srv/bench/images/vyx.img
     echo '{"slow": {"/images/vyx.img": 2097152}}' >/srv/bench/.control.json
 
-    PORT_FILE=$(mktemp)
-    python3 "$SRC/tests/support/update_server.py" /srv/bench >"$PORT_FILE" &
-    SERVER_PID=$!
+    kyto_bench_start_server /srv/bench
     WGET_PID=
     trap 'kill $WGET_PID $SERVER_PID 2>/dev/null; wait 2>/dev/null || true' EXIT
-    for _ in $(seq 100); do
-        [ -s "$PORT_FILE" ] && break
-        sleep 0.1
-    done
-    URL="http://127.0.0.1:$(head -n1 "$PORT_FILE")/images/vyx.img"
+    URL="http://127.0.0.1:$PORT/images/vyx.img"
     # The library's own wget command line, its progress log and its pid file.
     /usr/kyto/bin/wget -O /volume1/@autoupdate/vyx.img "$URL" --timeout=15 --tries=1 \
         --no-dns-cache >/dev/null 2>/var/run/downloadprogress &

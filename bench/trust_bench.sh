@@ -23,13 +23,13 @@
 set -euo pipefail
 
 SRC=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
+source "$SRC/bench/bench_lib.sh"
 
 if [ "${1:-}" != "--inside" ]; then
     command -v minisign >/dev/null || {
         echo "trust_bench.sh: minisign is missing (apt-get install minisign)" >&2
         exit 1
     }
-    source "$SRC/bench/bench_lib.sh"
     kyto_bench_enter_sandbox "$SRC/bench/trust_bench.sh" "kytoupdate kytosite" "${1:-5}"
 fi
 
@@ -51,15 +51,9 @@ mount -t tmpfs -o size=$((SIZE_MIB * 3 + 256))m tmpfs /srv/bench
 mkdir -p $WORK /srv/bench/www
 head -c $((SIZE_MIB << 20)) /dev/urandom >"$IMAGE"
 
-PORT_FILE=$(mktemp)
-python3 "$SRC/tests/support/update_server.py" /srv/bench/www >"$PORT_FILE" &
-SERVER_PID=$!
-trap 'kill "$SERVER_PID" 2>/dev/null; wait "$SERVER_PID" 2>/dev/null || true' EXIT
-for _ in $(seq 100); do
-    [ -s "$PORT_FILE" ] && break
-    sleep 0.1
-done
-BASE="http://127.0.0.1:$(head -n1 "$PORT_FILE")/site"
+kyto_bench_start_server /srv/bench/www
+trap kyto_bench_stop_server EXIT
+BASE="http://127.0.0.1:$PORT/site"
 
 # The served site, signed; the device's feed address points at it.
 SITE=/srv/bench/www/site
