@@ -15,12 +15,9 @@ const char* const kAutoLock = "/var/run/kytoupdate-auto.lock";
 
 int CmdAuto() {
     // One auto-update at a time, whoever starts it (the timer, cron, a person).
-    bool busy = false;
-    const kyto::UniqueFd lock = TryLock(kAutoLock, &busy);
-    if (busy)
-        return Fail("another automatic update is running");
-    if (!lock.valid())
-        return Fail(std::string("cannot open ") + kAutoLock);
+    kyto::UniqueFd lock;
+    if (const int rc = TryLock(kAutoLock, "another automatic update is running", lock); rc >= 0)
+        return rc;
     CatchStopSignals();
     SystemUpdate su;
     const int rc = CheckAndDownload(su);

@@ -43,12 +43,15 @@ int Fail(const std::string& text, int code) {
     return code;
 }
 
-kyto::UniqueFd TryLock(const char* path, bool* busy) {
-    kyto::UniqueFd lock(open(path, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
-    *busy = lock.valid() && flock(lock.get(), LOCK_EX | LOCK_NB) != 0;
-    if (*busy)
+int TryLock(const char* path, const std::string& busyText, kyto::UniqueFd& lock) {
+    lock.reset(open(path, O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    if (!lock.valid())
+        return Fail(std::string("cannot open ") + path);
+    if (flock(lock.get(), LOCK_EX | LOCK_NB) != 0) {
         lock.reset();
-    return lock;
+        return Fail(busyText);
+    }
+    return -1;
 }
 
 const char* RestartWord(int restartType) {

@@ -40,10 +40,10 @@ void SleepMs(long ms);
 // "kytoupdate: <text>" on standard error; Fail returns code for the caller to exit with.
 void Note(const std::string& text);
 int Fail(const std::string& text, int code = kExitFailed);
-// Takes the lock file at path without waiting; an invalid descriptor when another process
-// holds it or the file cannot be opened (*busy tells which).  The lock lasts as long as the
-// descriptor and the children forked while it is open.
-kyto::UniqueFd TryLock(const char* path, bool* busy);
+// Takes the lock file at path without waiting into lock; -1 when taken, else the exit code,
+// with busyText (another process holds it) or the open failure noted.  The lock lasts as
+// long as the descriptor and the children forked while it is open.
+int TryLock(const char* path, const std::string& busyText, kyto::UniqueFd& lock);
 
 // Words printed for the library's numbers.
 const char* RestartWord(int restartType);

@@ -223,12 +223,11 @@ int CheckAndDownload(SystemUpdate& su) {
     // A cancelled small update stops only after the package it is fetching, while its status
     // already reads stopped: the lock, held until this download's process has ended, keeps a
     // new download out of the package folder until then.
-    bool busy = false;
-    const kyto::UniqueFd lock = TryLock(kDownloadLock, &busy);
-    if (busy)
-        return Fail("a cancelled download is still stopping; try again in a moment");
-    if (!lock.valid())
-        return Fail(std::string("cannot open ") + kDownloadLock);
+    kyto::UniqueFd lock;
+    if (const int locked = TryLock(
+            kDownloadLock, "a cancelled download is still stopping; try again in a moment", lock);
+        locked >= 0)
+        return locked;
     const int rc = Check(su);
     if (rc >= 0)
         return rc;
