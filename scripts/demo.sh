@@ -13,7 +13,14 @@
 # Everything the demo writes inside the appliance root vanishes with it; afterwards the
 # host's appliance paths are checked.  KYTO_DEMO_IMAGE_MB sets the release image's size (default 96),
 # KYTO_BUILD_DIR the build folder.
+#
+#   bash scripts/demo.sh --page
+#
+# sets up the same site and appliance, then serves the sample update page (www/) on
+# http://127.0.0.1:8090/ in the appliance's network until Ctrl-C.
 set -euo pipefail
+PAGE_ARGS=()
+if [ "${1:-}" = --page ]; then PAGE_ARGS=(--page); fi
 cd "$(dirname "$0")/.."
 ROOT=$(pwd)
 source scripts/deps.sh
@@ -56,7 +63,7 @@ BEFORE=$(snapshot_host)
 echo "== build kytoupdate, kytosite and the sandbox launcher in $BUILD"
 cmake -S . -B "$BUILD" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DKYTO_BUILD_TESTS=ON -DKYTO_WERROR=ON \
     >/dev/null
-if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kytosite kyto-sandbox \
+if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kytosite kyto-sandbox kytoupdate-cgi \
     >"$BUILD/demo-build.log" 2>&1; then
     tail -n 30 "$BUILD/demo-build.log"
     echo "demo.sh: FAILED (build; log: $BUILD/demo-build.log)"
@@ -64,7 +71,7 @@ if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kytosite kyto-sandb
 fi
 
 RC=0
-"$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" || RC=$?
+"$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" "${PAGE_ARGS[@]}" || RC=$?
 
 echo
 echo "== host root check"

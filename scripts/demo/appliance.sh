@@ -6,10 +6,19 @@
 # fixes of build 5644, packages built with dpkg-deb), signs it with a demo key made on the
 # spot and checks it as an appliance would, served by nginx on 127.0.0.1.  Then kytoupdate,
 # trusting that key, drives the small update as an administrator would, refuses a package
-# altered on the server, and downloads release 5.2-5700 once it is published.
-#   appliance.sh BUILD_DIR
+# altered on the server, and downloads release 5.2-5700 once it is published.  With --page,
+# the appliance stops before the first check and serves the sample update page (page.sh)
+# instead: COMMAND (the page test's browser driver) runs against it, or else it waits for
+# Ctrl-C.
+#   appliance.sh BUILD_DIR [--page [COMMAND ARGS...]]
 set -euo pipefail
 BUILD=$1
+PAGE=0
+if [ "${2:-}" = --page ]; then
+    PAGE=1
+    shift 2
+fi
+PAGE_PORT=8090
 HERE=$(cd "$(dirname "$0")" && pwd)
 KYTOUPDATE=$BUILD/tools/kytoupdate
 KYTOSITE=$BUILD/tools/kytosite
@@ -35,7 +44,10 @@ download() {
     "$KYTOUPDATE" download
 }
 stop_server() {
-    if [ -f $STATE/nginx.pid ]; then kill "$(cat $STATE/nginx.pid)" 2>/dev/null || true; fi
+    local pid
+    for pid in $STATE/nginx.pid /run/kyto-page/nginx.pid; do
+        if [ -f $pid ]; then kill "$(cat $pid)" 2>/dev/null || true; fi
+    done
 }
 trap stop_server EXIT
 installed() { dpkg-query -W -f='${Status}' "$1" 2>/dev/null | grep -q 'install ok installed'; }
@@ -108,6 +120,19 @@ cp /usr/kyto/etc/rc.d/S20samba.sh /usr/kyto/etc/rc.d/S80samba.sh
 install -D -m 0644 $KEYS/demo.pub $TRUST/demo.pub
 sed 's/^/  /' /etc.defaults/VERSION
 echo "  $TRUST: $(ls $TRUST)"
+
+if [ $PAGE -eq 1 ]; then
+    say "the update page: nginx on http://127.0.0.1:$PAGE_PORT/ (fcgiwrap, kytoupdate-cgi)"
+    "$HERE/page.sh" "$BUILD" $PAGE_PORT
+    if [ $# -gt 0 ]; then
+        "$@"
+        exit
+    fi
+    echo "open http://127.0.0.1:$PAGE_PORT/ from inside the sandbox's network, e.g."
+    echo "  nsenter -t $$ -n curl -s http://127.0.0.1:$PAGE_PORT/api/status"
+    echo "Ctrl-C ends the appliance."
+    while :; do sleep 3600; done
+fi
 
 say "is there an update?"
 rc=0
