@@ -226,7 +226,7 @@ Json::Value ActionRecord(const char* action, const Result& r) {
     _exit(0);
 }
 
-// Starts the download in its own session (double fork) and waits up to two seconds for a
+// Starts the download in its own session (double fork) and waits up to a second for a
 // quick end, such as the library refusing a second download.
 Json::Value StartDownload(const Config& c) {
     Json::Value running(Json::objectValue);
@@ -245,7 +245,7 @@ Json::Value StartDownload(const Config& c) {
     }
     if (pid > 0)
         waitpid(pid, nullptr, 0);
-    for (int i = 0; i < 20; ++i) {
+    for (int i = 0; i < 10; ++i) {
         struct timespec ts {
             0, 100 * 1000 * 1000
         };
@@ -287,6 +287,9 @@ Json::Value Status(const Config& c) {
     v["installed"] = Installed();
     v["check"] = ParseJson(ReadFile(c.state + "/check.json"));
     v["last"] = ParseJson(ReadFile(c.state + "/last.json"));
+    // The download's last progress line ("33%  package 2 of 3  532.7 KiB/s  0:03 left").
+    std::string log = ReadFile(c.state + "/download.log");
+    v["progress"] = LastLine(log.size() > 4096 ? log.substr(log.size() - 4096) : log);
     return v;
 }
 
@@ -315,14 +318,14 @@ void ReplyError(int code, const char* reason, const std::string& text, const cha
 }
 
 // A post must come from the page itself: Sec-Fetch-Site, when sent, says same-origin, and
-// Origin, which is required, names this server.
+// Origin, which is required, is the page's origin (KYTO_PAGE_ORIGIN, set by the server from
+// the request's scheme and Host).
 bool SameOrigin() {
     const std::string site = Env("HTTP_SEC_FETCH_SITE");
     if (!site.empty() && site != "same-origin")
         return false;
-    const std::string origin = Env("HTTP_ORIGIN"), host = Env("HTTP_HOST");
-    return !origin.empty() && !host.empty() &&
-           (origin == "http://" + host || origin == "https://" + host);
+    const std::string origin = Env("HTTP_ORIGIN"), page = Env("KYTO_PAGE_ORIGIN");
+    return !origin.empty() && origin == page;
 }
 
 int Serve(const Config& c) {

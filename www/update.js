@@ -57,8 +57,10 @@ function render(data) {
   const shown = words === "none" ? 0 : Math.max(0, Math.min(100, pct));
   el("bar-fill").style.width = shown + "%";
   el("percent").textContent = shown + "%";
+  const pkg = /package (\d+) of (\d+)/.exec(data.progress || "");
   el("items").textContent = vyx && s.vyxupdate.images > 0
-    ? "(image " + s.vyxupdate.image + " of " + s.vyxupdate.images + ")" : "";
+    ? "(image " + s.vyxupdate.image + " of " + s.vyxupdate.images + ")"
+    : words === "downloading" && pkg ? "(package " + pkg[1] + " of " + pkg[2] + ")" : "";
   el("download-state").textContent = words;
   el("apply-state").textContent = s.apply.stage === "none" ? "Not applied." :
     s.apply.stage + " " + s.apply.percentage + "%" + (s.apply.error ? " (" + s.apply.error + ")" : "");
