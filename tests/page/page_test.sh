@@ -60,6 +60,10 @@ mkdir -p $SHOTS
 export HOME=/tmp
 rc=0
 python3 "$HERE/page_browser.py" $B $SHOTS || rc=$?
+if [ $rc -ne 0 ]; then
+    echo "-- download.log"; cat /run/kyto-page/download.log
+    echo "-- system log"; grep -h kytoupdate /var/log/sandbox.syslog | tail -n 15
+fi
 echo "SHOTS BEGIN"
 tar -c -C $SHOTS . | base64
 echo "SHOTS END"
