@@ -1,4 +1,4 @@
-// What every command of kytoupdate shares: the exit codes (kytoupdate(1)), the notes and
+// What every command of kytoupdate shares: the exit codes (kytoupdate_exit.h), the notes and
 // errors on standard error, the stop signals, and the words the commands print for the
 // library's numbers.  Each command is declared here and defined in the file of its concern:
 // kytoupdate_download.cpp, kytoupdate_apply.cpp, kytoupdate_plan.cpp, kytoupdate_auto.cpp
@@ -11,20 +11,12 @@
 #include <functional>
 #include <string>
 
+#include "kytoupdate_exit.h"
 #include "scoped.h"
 #include "smallupdate.h"
 #include "systemupdate.h"
 
 namespace kytoupdate {
-
-// Exit codes.
-constexpr int kExitOk = 0;           // done; for check: an update is available
-constexpr int kExitFailed = 1;       // the operation failed
-constexpr int kExitCannotCheck = 2;  // the update server could not be asked
-constexpr int kExitUpToDate = 3;     // no update: the system is up to date
-constexpr int kExitStopped = 4;      // the download was stopped by a cancel
-constexpr int kExitRefused = 5;      // refused: not signed by a trusted key
-constexpr int kExitUsage = 64;       // bad command line
 
 // What SmallUpdate::GetServiceRestartType answers; the library names none of its numbers.
 constexpr int kRestartNone = 0;

@@ -18,23 +18,39 @@
 namespace kytoupdate {
 
 bool StatusSnapshot::operator==(const StatusSnapshot& o) const {
-    return downloading == o.downloading && vyxReadable == o.vyxReadable &&
-           vyxStatus == o.vyxStatus && vyxPercentage == o.vyxPercentage && image == o.image &&
-           images == o.images && imagePath == o.imagePath && smallStatus == o.smallStatus &&
+    return installed == o.installed && smallFix == o.smallFix && downloading == o.downloading &&
+           vyxReadable == o.vyxReadable && vyxStatus == o.vyxStatus &&
+           vyxPercentage == o.vyxPercentage && image == o.image && images == o.images &&
+           imagePath == o.imagePath && smallStatus == o.smallStatus &&
            smallPercentage == o.smallPercentage && applyStage == o.applyStage &&
            applyPercentage == o.applyPercentage && applyError == o.applyError &&
            downloaded == o.downloaded;
 }
 
-std::string DownloadStatusKey(const char* key) {
+namespace {
+
+std::string FileKey(const char* file, const char* key) {
     char buf[4096] = {0};
-    if (KLIBCFileGetKeyValue(kyto::kDownloadStatusFile, key, buf, sizeof(buf), 0) <= 0)
+    if (KLIBCFileGetKeyValue(file, key, buf, sizeof(buf), 0) <= 0)
         return "";
     return buf;
 }
 
+}  // namespace
+
+std::string DownloadStatusKey(const char* key) {
+    return FileKey(kyto::kDownloadStatusFile, key);
+}
+
+std::string VersionKey(const char* key) {
+    return FileKey(kyto::kVersionFile, key);
+}
+
 StatusSnapshot TakeSnapshot() {
     StatusSnapshot s;
+    s.installed = VersionKey("majorversion") + "." + VersionKey("minorversion") + "-" +
+                  VersionKey("buildnumber");
+    s.smallFix = atoi(VersionKey("smallfixnumber").c_str());
     s.downloading = DownloadStatusKey(kyto::kKeyUpdateType);
 
     VyxUpdate::VYX_DOWNLOAD_STATUS vyx = VyxUpdate::VYX_DOWNLOAD_STATUS_NONE;
@@ -75,6 +91,7 @@ Json::Value Object(std::initializer_list<std::pair<const char*, Json::Value>> me
 
 Json::Value ToJson(const StatusSnapshot& s) {
     return Object({
+        {"installed", Object({{"version", s.installed}, {"smallfix", s.smallFix}})},
         {"downloading", s.downloading},
         {"downloaded", s.downloaded},
         {"vyxupdate", Object({{"status", s.vyxStatus},
@@ -91,6 +108,7 @@ Json::Value ToJson(const StatusSnapshot& s) {
 
 std::string ToText(const StatusSnapshot& s) {
     std::ostringstream out;
+    out << "installed: " << s.installed << ", small fix " << s.smallFix << "\n";
     out << "full release download: " << s.vyxStatus;
     if (s.vyxStatus == "downloading" || s.vyxStatus == "finished")
         out << " " << s.vyxPercentage << "%";

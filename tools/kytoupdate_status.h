@@ -12,6 +12,10 @@
 namespace kytoupdate {
 
 struct StatusSnapshot {
+    // The installed system from the version file: "major.minor-build" and the small-fix
+    // level (0 before the first small update).
+    std::string installed;
+    int smallFix = 0;
     // "updateType" of the shared download status file: which engine is (or was last)
     // downloading; "" when there is no status file.
     std::string downloading;
@@ -40,11 +44,13 @@ struct StatusSnapshot {
 
 StatusSnapshot TakeSnapshot();
 Json::Value ToJson(const StatusSnapshot& s);
-// Three lines for a person: full release, small update, apply.
+// Lines for a person: installed, full release, small update, apply.
 std::string ToText(const StatusSnapshot& s);
 
-// Reads one key of the shared download status file; "" when it is missing.
+// Reads one key of the shared download status file or of the version file; "" when it is
+// missing.
 std::string DownloadStatusKey(const char* key);
+std::string VersionKey(const char* key);
 
 }  // namespace kytoupdate
 

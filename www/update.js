@@ -1,19 +1,10 @@
 // The sample update page: polls /api/status every second and posts the four actions.
+// Every word about an action's end comes from the back end (its "words" and "message").
 "use strict";
 
 const state = { busy: "", status: null };
 
 const el = (id) => document.getElementById(id);
-
-// Words a person understands for kytoupdate's exit codes.
-const EXIT_WORDS = {
-  1: "The operation failed.",
-  2: "The update server could not be reached.",
-  3: "The system is up to date.",
-  4: "The download was stopped.",
-  5: "Refused: the update is not signed by a trusted key.",
-  64: "The request was not understood.",
-};
 
 function showMessage(text, isError) {
   const m = el("message");
@@ -21,11 +12,22 @@ function showMessage(text, isError) {
   m.className = isError ? "error" : "";
 }
 
-// "smallupdate VYX 5.2-5644 update 2" -> kind and version.
+// What a finished action says: kytoupdate's own note when it left one, else the back end's
+// sentence for its exit code.
+function endText(end) {
+  return end.action + ": " + (end.message || end.words || "failed");
+}
+
+// An end a person asked for or should simply know: up to date, a download they cancelled.
+function isError(end) {
+  return end.exit !== 0 && !(end.action === "check" && end.exit === 3) &&
+    !(end.action === "download" && end.exit === 4);
+}
+
+// The check's answer "smallupdate VYX 5.2-5644 update 2" as kind and version.
 function offerText(check) {
   if (!check) return "Not checked yet.";
-  if (check.exit === 3) return "None: the system is up to date.";
-  if (check.exit !== 0) return EXIT_WORDS[check.exit] || "The check failed.";
+  if (check.exit !== 0) return check.words;
   const words = check.output.split(" ");
   const kind = words[0] === "vyx" ? "Full release" : "Small update";
   return kind + ": " + words.slice(1).join(" ");
@@ -41,41 +43,60 @@ function downloadWords(s) {
   return "none";
 }
 
+// "(image 1 of 1)" from the status, or "(package 2 of 3)" from the download's progress line.
+function itemsText(s, words, vyx, progress) {
+  if (vyx && s.vyxupdate.images > 0)
+    return "(image " + s.vyxupdate.image + " of " + s.vyxupdate.images + ")";
+  const pkg = /package (\d+) of (\d+)/.exec(progress || "");
+  return words === "downloading" && pkg ? "(package " + pkg[1] + " of " + pkg[2] + ")" : "";
+}
+
+function applyText(s) {
+  const a = s.apply;
+  if (a.stage === "none") {
+    return s.downloaded === "vyxupdate"
+      ? "The downloaded release is installed by the installer, not from this page."
+      : "Not applied.";
+  }
+  if (a.stage === "reboot") return "Applied: restart the appliance to finish the update.";
+  return a.stage + " " + a.percentage + "%" + (a.error ? " (error: " + a.error + ")" : "");
+}
+
 function render(data) {
   state.status = data;
-  el("installed").textContent = data.installed.version;
-  el("smallfix").textContent = String(data.installed.smallfix);
   el("offer").textContent = offerText(data.check);
   const s = data.status;
   if (!s) {
     showMessage(data.error || "The status could not be read.", true);
     return;
   }
-  const vyx = s.downloading === "vyx" || s.downloaded === "vyx";
+  el("installed").textContent = s.installed.version;
+  el("smallfix").textContent = String(s.installed.smallfix);
+  const vyx = s.downloading === "vyxupdate" || s.downloaded === "vyxupdate";
   const pct = vyx ? s.vyxupdate.percentage : s.smallupdate.percentage;
-  const words = downloadWords(s);
+  let words = downloadWords(s);
+  // A cancelled small update ends the package it is fetching before it stops.
+  const running = Boolean(data.last && data.last.running);
+  if (words === "cancelled" && running) words = "stopping";
   const shown = words === "none" ? 0 : Math.max(0, Math.min(100, pct));
   el("bar-fill").style.width = shown + "%";
   el("percent").textContent = shown + "%";
-  const pkg = /package (\d+) of (\d+)/.exec(data.progress || "");
-  el("items").textContent = vyx && s.vyxupdate.images > 0
-    ? "(image " + s.vyxupdate.image + " of " + s.vyxupdate.images + ")"
-    : words === "downloading" && pkg ? "(package " + pkg[1] + " of " + pkg[2] + ")" : "";
+  el("items").textContent = itemsText(s, words, vyx, data.progress);
   el("download-state").textContent = words;
-  el("apply-state").textContent = s.apply.stage === "none" ? "Not applied." :
-    s.apply.stage + " " + s.apply.percentage + "%" + (s.apply.error ? " (" + s.apply.error + ")" : "");
+  el("apply-state").textContent = applyText(s);
+  el("apply-state").className = s.apply.stage === "reboot" ? "reboot" : "";
   const last = data.last;
   if (last && !last.running && last.exit !== 0 && !state.busy) {
-    showMessage(last.action + ": " + (last.message || EXIT_WORDS[last.exit] || "failed"), true);
+    showMessage(endText(last), isError(last));
   }
-  buttons(words, data);
+  buttons(words, data, running);
 }
 
-function buttons(words, data) {
-  const busy = state.busy !== "";
+function buttons(words, data, running) {
+  const busy = state.busy !== "" || running;
   const offered = data.check && data.check.exit === 0;
   el("check").disabled = busy || words === "downloading";
-  el("download").disabled = busy || !offered || words === "downloaded";
+  el("download").disabled = busy || !offered || words === "downloading" || words === "downloaded";
   el("cancel").disabled = words !== "downloading";
   el("apply").disabled = busy || words !== "downloaded" || data.status.downloaded !== "smallupdate";
 }
@@ -94,18 +115,11 @@ async function act(action) {
   showMessage(action + "…", false);
   try {
     const r = await fetch("/api/" + action, { method: "POST" });
-    const body = await r.json();
-    if (!r.ok) {
-      showMessage(action + ": " + (body.error || r.statusText), true);
-    } else if (body.running) {
-      showMessage("Download started.", false);
-    } else if (body.exit === 0) {
-      showMessage(action + ": " + (body.output || "done"), false);
-    } else if (action === "check" && body.exit === 3) {
-      showMessage("The system is up to date.", false);
-    } else {
-      showMessage(action + ": " + (body.message || EXIT_WORDS[body.exit] || "failed"), true);
-    }
+    const end = await r.json();
+    if (!r.ok) showMessage(action + ": " + (end.error || r.statusText), true);
+    else if (end.running) showMessage("Download started.", false);
+    else if (end.exit === 0) showMessage(action + ": " + (end.output || end.words), false);
+    else showMessage(endText(end), isError(end));
   } catch (e) {
     showMessage(action + ": the appliance does not answer (" + e.message + ").", true);
   }

@@ -60,7 +60,8 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
     EXPECT_FALSE(Has(r.out, "\r"));
 
     // Both engines and the apply as the interface's back end reads them.
-    EXPECT_EQ(ParseJson(R"({"downloading":"","downloaded":"smallupdate",
+    EXPECT_EQ(ParseJson(R"({"installed":{"version":"5.2-5644","smallfix":0},
+        "downloading":"","downloaded":"smallupdate",
         "vyxupdate":{"status":"none","percentage":0,"image":0,"images":0,"path":""},
         "smallupdate":{"status":"finished","percentage":100},
         "apply":{"stage":"none","percentage":0,"error":""}})"),
@@ -89,6 +90,7 @@ TEST_F(KytoupdateTest, SmallUpdateDownloadStatusPlanApply) {
                                                          {"S01iptables.sh", "start"},
                                                          {"kytopkg", "start", "DemoApp"}};
     EXPECT_EQ(calls, RecordedCalls());
+    EXPECT_TRUE(Has(Cmd("status").out, "installed: 5.2-5644, small fix 1\n"));
     EXPECT_TRUE(Has(Cmd("status").out, "apply: finished 100%"));
     ExpectRuns({{"apply", 1, "", "no downloaded update"}});  // consumed
 }
