@@ -45,19 +45,7 @@ snapshot_host() {
 
 echo "== packages"
 kyto_install_packages "${KYTO_BUILD_PACKAGES[@]}" "${KYTO_TEST_PACKAGES[@]}"
-# Installing nginx would start Debian's own nginx service on the host; the demo needs only
-# the program, so services are not started during that install (policy-rc.d, exit 101).
-POLICY=/usr/sbin/policy-rc.d
-if [ ! -e $POLICY ]; then
-    printf '#!/bin/sh\nexit 101\n' >$POLICY
-    chmod 0755 $POLICY
-    trap 'rm -f $POLICY' EXIT
-    kyto_install_packages "${KYTO_DEMO_PACKAGES[@]}"
-    rm -f $POLICY
-    trap - EXIT
-else
-    kyto_install_packages "${KYTO_DEMO_PACKAGES[@]}"
-fi
+kyto_install_packages_without_services "${KYTO_DEMO_PACKAGES[@]}"
 BEFORE=$(snapshot_host)
 
 echo "== build kytoupdate, kytosite and the sandbox launcher in $BUILD"

@@ -33,6 +33,25 @@ kyto_install_packages() {
     apt-get install -y -qq --no-install-recommends "${missing[@]}" >/dev/null
 }
 
+# Installs packages without starting their services on the host: Debian's nginx and
+# fcgiwrap would start theirs, and the demo and the tests need only the programs.  A
+# policy-rc.d that refuses every start (exit 101) lives for the length of the install; one
+# already there is left as it is.  Sets and then clears the EXIT trap.
+kyto_install_packages_without_services() {
+    local policy=/usr/sbin/policy-rc.d rc=0
+    if [ -e $policy ]; then
+        kyto_install_packages "$@"
+        return
+    fi
+    printf '#!/bin/sh\nexit 101\n' >$policy
+    chmod 0755 $policy
+    trap "rm -f $policy" EXIT
+    kyto_install_packages "$@" || rc=$?
+    rm -f $policy
+    trap - EXIT
+    return $rc
+}
+
 kyto_require_root() {
     if [ "$(id -u)" -ne 0 ]; then
         echo "$0: must run as root (package installation and the test sandbox need it)" >&2

@@ -52,6 +52,8 @@ done
 
 step "packages"
 kyto_install_packages "${KYTO_BUILD_PACKAGES[@]}" "${KYTO_TEST_PACKAGES[@]}"
+# The update page's test: nginx and fcgiwrap (their services not started) and Chromium.
+kyto_install_packages_without_services "${KYTO_DEMO_PACKAGES[@]}" "${KYTO_PAGE_TEST_PACKAGES[@]}"
 
 # Entries of the host folders a leaking test would write into, taken after the package
 # step (apt writes logs of its own) and compared after the run.

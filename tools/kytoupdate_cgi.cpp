@@ -1,7 +1,7 @@
 // kytoupdate-cgi: the back end of the sample update page (www/), run as CGI by fcgiwrap
 // behind nginx.
 //   GET  /api/status    the JSON of `kytoupdate status --json` with the last check's answer,
-//                       the last action's end and the running download's progress line
+//                       the last action's end, the page's download and its progress line
 //   POST /api/check | /api/download | /api/cancel | /api/apply
 //                       runs `kytoupdate <action>` (only these four words, never a shell);
 //                       a download runs detached and survives the browser closing
@@ -73,7 +73,8 @@ Json::Value Status(const Config& c) {
     else
         v["error"] = LastNote(r.err).empty() ? "the status could not be read" : LastNote(r.err);
     v["check"] = ReadJson(c.Path("check.json"));
-    v["last"] = LastAction(c);
+    v["last"] = ReadJson(c.Path("last.json"));
+    v["download"] = DownloadRecord(c);
     v["progress"] = ProgressLine(c);
     return v;
 }

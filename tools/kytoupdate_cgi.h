@@ -1,7 +1,8 @@
 // kytoupdate-cgi, the back end of the sample update page (www/): what its request handling
 // (kytoupdate_cgi.cpp) and its runs of kytoupdate (kytoupdate_cgi_run.cpp) share.  The
-// state folder holds the page's own records: the last check's answer (check.json), the
-// last action's end (last.json) and the output of the downloads it started (download.log).
+// state folder holds the page's own records: the last check's answer (check.json), the end
+// of the last check, cancel or apply (last.json), the download it started, running or ended
+// (download.json), and the output of its downloads (download.log).
 #ifndef KYTOUPDATE_CGI_H
 #define KYTOUPDATE_CGI_H
 
@@ -33,14 +34,16 @@ Result Run(const Config& c, const char* word, const char* flag = nullptr);
 Json::Value ActionRecord(const char* action, const Result& r);
 
 // Starts `kytoupdate download` detached from the request (its own session; it survives the
-// browser closing and the server ending the request), its output appended to download.log
-// and its end recorded in last.json.  Answers the end when it comes within a second (a
-// refusal), else the record of a running download.
+// browser closing and the server ending the request), its output appended to download.log.
+// Answers once the download has begun (the running record, also in download.json) or has
+// ended without beginning (a refusal, an up-to-date system: its end), or after 30 seconds
+// of checking.  A download's end goes to download.json; a refusal because another download
+// runs leaves that download's record there.
 Json::Value StartDownload(const Config& c);
 
-// last.json, the last action's record; a running download whose supervising process is
-// gone (killed) reads as failed.
-Json::Value LastAction(const Config& c);
+// download.json, the record of the page's download; a running one whose supervising process
+// is gone (killed) reads as failed.
+Json::Value DownloadRecord(const Config& c);
 
 // The last "kytoupdate: ..." note in text, without the prefix; the last other line.
 std::string LastNote(const std::string& text);

@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <fstream>
+#include <memory>
 #include <sstream>
 
 #include "json_members.h"
@@ -21,6 +22,10 @@ namespace {
 // The start of kytoupdate's notes and errors on standard error.
 const std::string kNotePrefix = "kytoupdate: ";
 
+// How long a request waits for a download to begin or be refused (the check comes first).
+constexpr int kStartWaitMs = 30 * 1000;
+constexpr int kPollMs = 100;
+
 // What a supervisor keeps of a download's output for its record: the end is what counts.
 constexpr size_t kKeptOutput = 64 * 1024;
 
@@ -31,6 +36,7 @@ constexpr size_t kKeptOutput = 64 * 1024;
     if (null < 0 || dup2(null, 0) < 0 || dup2(out, 1) < 0 || dup2(err, 2) < 0)
         _exit(127);
     close_range(3, ~0U, 0);
+    signal(SIGPIPE, SIG_DFL);
     const char* argv[] = {c.program.c_str(), word, flag, nullptr};
     execv(c.program.c_str(), const_cast<char* const*>(argv));
     _exit(127);
@@ -75,12 +81,38 @@ bool Pipe(kyto::UniqueFd& read, kyto::UniqueFd& write) {
     return true;
 }
 
-// In the detached process: runs the download, appends its output to the log, records its
-// end as the last action, and ends.
-[[noreturn]] void Supervise(const Config& c, Json::Value running) {
-    // Who to ask whether the download still runs, should this process not live to say.
-    running["pid"] = static_cast<Json::Int64>(getpid());
-    WriteJson(c.Path("last.json"), running);
+Json::Value RunningRecord() {
+    Json::Value v(Json::objectValue);
+    v["action"] = "download";
+    v["running"] = true;
+    v["time"] = static_cast<Json::Int64>(time(nullptr));
+    return v;
+}
+
+// Sends one record to the request that started the download, once; a request that has
+// stopped waiting is no harm.
+void Report(kyto::UniqueFd& report, const Json::Value& record) {
+    if (!report.valid())
+        return;
+    Json::StreamWriterBuilder b;
+    b["indentation"] = "";
+    kyto::WriteAll(report.get(), Json::writeString(b, record));
+    report.reset();
+}
+
+// True when download.json names a running download of another, live, process.
+bool AnotherDownloadRuns(const Config& c) {
+    const Json::Value record = DownloadRecord(c);
+    return record.isObject() && record["running"].asBool() && record["pid"].asInt64() != getpid();
+}
+
+// In the detached process: runs the download with its output appended to the log.  Once
+// kytoupdate says it is downloading, the running record (with this process's pid) goes to
+// download.json and to the request; at the end, the end goes to download.json, unless the download
+// never began because another is running (whose record stays), and to a request still
+// waiting (a refusal, an up-to-date system, an unreachable server).
+[[noreturn]] void Supervise(const Config& c, kyto::UniqueFd report) {
+    signal(SIGPIPE, SIG_IGN);
     kyto::UniqueFd read, write;
     if (!Pipe(read, write))
         _exit(1);
@@ -91,20 +123,30 @@ bool Pipe(kyto::UniqueFd& read, kyto::UniqueFd& write) {
         ExecChild(c, "download", nullptr, write.get(), write.get());
     write.reset();
     Result r;
+    bool started = false;
     char buf[4096];
     ssize_t n;
     while ((n = kyto::ReadRetry(read.get(), buf, sizeof(buf))) > 0) {
         r.err.append(buf, static_cast<size_t>(n));
-        if (r.err.size() > 2 * kKeptOutput)
-            r.err.erase(0, r.err.size() - kKeptOutput);
         if (log.valid() && !kyto::WriteAll(log.get(), buf, static_cast<size_t>(n)))
             log.reset();
+        if (!started && r.err.find(kNotePrefix + "downloading ") != std::string::npos) {
+            started = true;
+            Json::Value running = RunningRecord();
+            running["pid"] = static_cast<Json::Int64>(getpid());
+            WriteJson(c.Path("download.json"), running);
+            Report(report, running);
+        }
+        if (r.err.size() > 2 * kKeptOutput)
+            r.err.erase(0, r.err.size() - kKeptOutput);
     }
     int status = 0;
     r.exit = pid > 0 && kyto::WaitForChild(pid, &status) == pid ? ExitCode(status) : 127;
     Json::Value end = ActionRecord("download", r);
     end["output"] = LastLine(r.err);
-    WriteJson(c.Path("last.json"), end);
+    if (started || !AnotherDownloadRuns(c))
+        WriteJson(c.Path("download.json"), end);
+    Report(report, end);
     _exit(0);
 }
 
@@ -145,48 +187,59 @@ Json::Value ActionRecord(const char* action, const Result& r) {
 }
 
 Json::Value StartDownload(const Config& c) {
-    Json::Value running(Json::objectValue);
-    running["action"] = "download";
-    running["running"] = true;
-    running["time"] = static_cast<Json::Int64>(time(nullptr));
-    const std::string last = c.Path("last.json");
-    WriteJson(last, running);
+    kyto::UniqueFd reportRead, reportWrite;
+    if (!Pipe(reportRead, reportWrite))
+        return ActionRecord("download", Result());
     const pid_t pid = fork();
     if (pid == 0) {
         // Away from the request: no terminal, no hang-up, and none of the server's pipes
         // held open (the server waits for their end before it answers).
         setsid();
         signal(SIGHUP, SIG_IGN);
+        reportRead.reset();
         const int null = open("/dev/null", O_RDWR | O_CLOEXEC);
         if (null < 0 || dup2(null, 0) < 0 || dup2(null, 1) < 0 || dup2(null, 2) < 0)
             _exit(1);
         if (fork() != 0)
             _exit(0);
-        Supervise(c, running);
+        Supervise(c, std::move(reportWrite));
     }
-    if (pid > 0)
-        kyto::WaitForChild(pid, nullptr);
-    for (int i = 0; i < 10; ++i) {
-        const struct timespec tenth = {0, 100 * 1000 * 1000};
-        nanosleep(&tenth, nullptr);
-        const Json::Value now = ReadJson(last);
-        if (now.isObject() && !now["running"].asBool())
-            return now;
+    reportWrite.reset();
+    if (pid < 0)
+        return ActionRecord("download", Result());
+    kyto::WaitForChild(pid, nullptr);
+    // The first record: running, or the end of a download that never began.
+    std::string text;
+    struct pollfd p = {reportRead.get(), POLLIN, 0};
+    char buf[4096];
+    for (int waited = 0; waited < kStartWaitMs && poll(&p, 1, kPollMs) >= 0; waited += kPollMs) {
+        if (!(p.revents & (POLLIN | POLLHUP | POLLERR)))
+            continue;
+        const ssize_t n = kyto::ReadRetry(reportRead.get(), buf, sizeof(buf));
+        if (n <= 0)
+            break;
+        text.append(buf, static_cast<size_t>(n));
     }
-    return running;
+    Json::Value first;
+    Json::CharReaderBuilder builder;
+    const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+    if (!reader->parse(text.data(), text.data() + text.size(), &first, nullptr) ||
+        !first.isObject())
+        return RunningRecord();  // still checking: the page's polling shows what comes
+    return first;
 }
 
-Json::Value LastAction(const Config& c) {
-    Json::Value last = ReadJson(c.Path("last.json"));
-    if (!last.isObject() || !last["running"].asBool() || !last["pid"].isIntegral())
-        return last;
-    const pid_t pid = static_cast<pid_t>(last["pid"].asInt64());
+Json::Value DownloadRecord(const Config& c) {
+    Json::Value record = ReadJson(c.Path("download.json"));
+    if (!record.isObject() || !record["running"].asBool() || !record["pid"].isIntegral())
+        return record;
+    const pid_t pid = static_cast<pid_t>(record["pid"].asInt64());
     if (pid > 0 && kill(pid, 0) != 0 && errno == ESRCH) {
-        last["running"] = false;
-        last["exit"] = kExitFailed;
-        last["words"] = "The download ended without a word (its process is gone).";
+        record["running"] = false;
+        record["exit"] = kExitFailed;
+        record["words"] = "The download ended without a word (its process is gone).";
     }
-    return last;
+    return record;
 }
 
 std::string LastNote(const std::string& text) {

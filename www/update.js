@@ -2,7 +2,8 @@
 // Every word about an action's end comes from the back end (its "words" and "message").
 "use strict";
 
-const state = { busy: "", status: null };
+// busy: the action being posted; shownEnd: the action end last put into the message.
+const state = { busy: "", status: null, shownEnd: "" };
 
 const el = (id) => document.getElementById(id);
 
@@ -12,10 +13,11 @@ function showMessage(text, isError) {
   m.className = isError ? "error" : "";
 }
 
-// What a finished action says: kytoupdate's own note when it left one, else the back end's
-// sentence for its exit code.
+// What a finished action says: its result line when it succeeded, else kytoupdate's own
+// note when it left one, else the back end's sentence for its exit code.
 function endText(end) {
-  return end.action + ": " + (end.message || end.words || "failed");
+  const text = end.exit === 0 ? end.output : end.message;
+  return end.action + ": " + (text || end.words);
 }
 
 // An end a person asked for or should simply know: up to date, a download they cancelled.
@@ -74,10 +76,16 @@ function render(data) {
   el("smallfix").textContent = String(s.installed.smallfix);
   const vyx = s.downloading === "vyxupdate" || s.downloaded === "vyxupdate";
   const pct = vyx ? s.vyxupdate.percentage : s.smallupdate.percentage;
+  const dl = data.download;
+  const running = Boolean(dl && dl.running);
   let words = downloadWords(s);
   // A cancelled small update ends the package it is fetching before it stops.
-  const running = Boolean(data.last && data.last.running);
   if (words === "cancelled" && running) words = "stopping";
+  // A stopped or failed download leaves no status behind; the page's record tells its end.
+  if (words === "none" && dl && !running && (!data.last || dl.time >= data.last.time)) {
+    if (dl.exit === 4) words = "cancelled";
+    else if (dl.exit === 1 || dl.exit === 5) words = "failed";
+  }
   const shown = words === "none" ? 0 : Math.max(0, Math.min(100, pct));
   el("bar-fill").style.width = shown + "%";
   el("percent").textContent = shown + "%";
@@ -85,8 +93,10 @@ function render(data) {
   el("download-state").textContent = words;
   el("apply-state").textContent = applyText(s);
   el("apply-state").className = s.apply.stage === "reboot" ? "reboot" : "";
-  const last = data.last;
-  if (last && !last.running && last.exit !== 0 && !state.busy) {
+  // The newer of the last action's end and the page's download.
+  const last = [data.last, data.download].filter(Boolean).sort((a, b) => b.time - a.time)[0];
+  if (last && !last.running && !state.busy && last.action + last.time !== state.shownEnd) {
+    state.shownEnd = last.action + last.time;
     showMessage(endText(last), isError(last));
   }
   buttons(words, data, running);
@@ -118,7 +128,6 @@ async function act(action) {
     const end = await r.json();
     if (!r.ok) showMessage(action + ": " + (end.error || r.statusText), true);
     else if (end.running) showMessage("Download started.", false);
-    else if (end.exit === 0) showMessage(action + ": " + (end.output || end.words), false);
     else showMessage(endText(end), isError(end));
   } catch (e) {
     showMessage(action + ": the appliance does not answer (" + e.message + ").", true);

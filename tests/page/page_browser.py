@@ -45,6 +45,7 @@ class Page:
         call("POST", self.s("/element/%s/click" % list(el.values())[0]), {})
 
     def shot(self, name):
+        time.sleep(0.5)  # the bar's transition
         self.step += 1
         png = base64.b64decode(call("GET", self.s("/screenshot")))
         with open(os.path.join(OUT, "%02d-%s.png" % (self.step, name)), "wb") as f:
@@ -87,14 +88,21 @@ def run(p):
     assert "error" in p.js("return document.getElementById('message').className")
     p.shot("refused")
     p.click("cancel")
-    p.wait("the download stopped", lambda: p.text("download-state") == "cancelled")
+    # The package being fetched ends first: the page says so and offers no new download.
+    p.wait("the download stopping", lambda: p.text("download-state") in ("stopping", "cancelled"))
+    if p.text("download-state") == "stopping":
+        assert not p.enabled("download") and not p.enabled("check")
+        p.shot("stopping")
+    p.wait("the download stopped", lambda: p.text("download-state") == "cancelled", 60)
     p.wait("download enabled again", lambda: p.enabled("download"))
+    assert "error" not in p.js("return document.getElementById('message').className")
     p.shot("cancelled")
     p.click("download")
     p.wait("downloaded", lambda: p.text("download-state") in ("downloaded", "failed"), 90)
     assert p.text("download-state") == "downloaded", p.text("message")
     p.wait("apply enabled", lambda: p.enabled("apply"))
     assert p.text("percent") == "100%", p.text("percent")
+    p.wait("the download's end", lambda: p.text("message").startswith("download: downloaded "))
     p.shot("downloaded")
     p.click("apply")
     p.wait("small fix 2", lambda: p.text("smallfix") == "2", 90)

@@ -49,9 +49,10 @@ done <<TABLE
 200 page $B/update.html
 TABLE
 status=$(curl -s $B/api/status)
-if python3 -c 'import json,sys; d=json.loads(sys.argv[1]); assert d["installed"]=={"version":"5.2-5644","smallfix":0}, d; assert d["status"]["smallupdate"]["status"]=="none", d' "$status"; then
+if python3 -c 'import json,sys; d=json.loads(sys.argv[1]); s=d["status"]; assert s["installed"]=={"version":"5.2-5644","smallfix":0}, d; assert s["smallupdate"]["status"]=="none" and d["check"] is None and d["download"] is None, d' "$status"; then
     echo "ok   status JSON: $status"
 else
+    echo "FAIL status JSON: $status"
     fails=1
 fi
 [ $fails -eq 0 ]
