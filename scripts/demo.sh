@@ -16,8 +16,9 @@
 #
 #   bash scripts/demo.sh --page
 #
-# sets up the same site and appliance, then serves the sample update page (www/) on
-# http://127.0.0.1:8090/ in the appliance's network until Ctrl-C.
+# sets up the same site and appliance, then serves the sample update page (www/) on the
+# appliance's loopback, brought to the host's as http://127.0.0.1:8090/ (socat), until
+# Ctrl-C.
 set -euo pipefail
 PAGE_ARGS=()
 if [ "${1:-}" = --page ]; then PAGE_ARGS=(--page); fi
@@ -59,7 +60,22 @@ if ! cmake --build "$BUILD" -j"$(nproc)" --target kytoupdate kytosite kyto-sandb
 fi
 
 RC=0
-"$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" "${PAGE_ARGS[@]}" || RC=$?
+if [ ${#PAGE_ARGS[@]} -eq 0 ]; then
+    "$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" || RC=$?
+else
+    # The appliance serves the page until Ctrl-C, which ends it, the forwarder and the demo
+    # alike; an end by Ctrl-C is the page demo's normal end.
+    "$BUILD/tests/kyto-sandbox" "$ROOT/scripts/demo/appliance.sh" "$BUILD" --page &
+    SANDBOX=$!
+    scripts/demo/page-forward.sh $SANDBOX 8090 &
+    FORWARD=$!
+    trap 'kill $FORWARD $SANDBOX 2>/dev/null || true' INT TERM
+    wait $SANDBOX || RC=$?
+    kill $FORWARD 2>/dev/null || true
+    wait $FORWARD 2>/dev/null || true
+    trap - INT TERM
+    if [ $RC -eq 130 ] || [ $RC -eq 143 ]; then RC=0; fi
+fi
 
 echo
 echo "== host root check"

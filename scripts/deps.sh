@@ -11,8 +11,9 @@ KYTO_TEST_PACKAGES=(googletest libgtest-dev libgmock-dev libbenchmark-dev wget o
 # Hardening checks (scripts/hardening.sh): libFuzzer targets built with clang, its runtime
 # libraries (libFuzzer and the sanitizers), and Valgrind's memcheck for the leak run.
 KYTO_HARDENING_PACKAGES=(clang libclang-rt-dev valgrind)
-# The sample update server of scripts/demo.sh, and fcgiwrap for its update page's back end.
-KYTO_DEMO_PACKAGES=(nginx fcgiwrap)
+# The sample update server of scripts/demo.sh, fcgiwrap for its update page's back end and
+# socat to bring that page from the sandbox's loopback to the host's.
+KYTO_DEMO_PACKAGES=(nginx fcgiwrap socat)
 # The update page's browser test (tests/page/page_test.sh): headless Chromium and ChromeDriver.
 KYTO_PAGE_TEST_PACKAGES=(chromium chromium-driver)
 

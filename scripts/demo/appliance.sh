@@ -128,9 +128,7 @@ if [ $PAGE -eq 1 ]; then
         "$@"
         exit
     fi
-    echo "open http://127.0.0.1:$PAGE_PORT/ from inside the sandbox's network, e.g."
-    echo "  nsenter -t $$ -n curl -s http://127.0.0.1:$PAGE_PORT/api/status"
-    echo "Ctrl-C ends the appliance."
+    # demo.sh --page brings the page to the host's loopback (page-forward.sh).
     while :; do sleep 3600; done
 fi
 
