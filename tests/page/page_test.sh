@@ -46,6 +46,7 @@ done <<TABLE
 403 other-origin -X POST -H Origin:http://127.0.0.1:8091 $B/api/check
 403 no-origin -X POST $B/api/check
 403 cross-site-fetch -X POST -H Origin:$B -H Sec-Fetch-Site:cross-site $B/api/check
+421 rebound-name -X POST -H Host:evil.example:8090 -H Origin:http://evil.example:8090 $B/api/check
 200 page $B/update.html
 TABLE
 status=$(curl -s $B/api/status)
