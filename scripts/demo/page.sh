@@ -18,7 +18,12 @@ rm -f $STATE/fcgiwrap.sock
     >>$STATE/fcgiwrap.log 2>&1 &)
 for _ in $(seq 50); do [ -S $STATE/fcgiwrap.sock ] && break; sleep 0.1; done
 chgrp www-data $STATE/fcgiwrap.sock
-sed -e "s|@PORT@|$PORT|; s|@STATE@|$STATE|g; s|@WWW@|$WWW|" \
+# nginx's workers (www-data) may not reach into the checkout (a clone in a private folder):
+# the page is served from a copy.
+rm -rf $STATE/www
+cp -r "$WWW" $STATE/www
+chgrp -R www-data $STATE/www
+sed -e "s|@PORT@|$PORT|; s|@STATE@|$STATE|g; s|@WWW@|$STATE/www|" \
     -e "s|@CGI@|$BUILD/tools/kytoupdate-cgi|; s|@KYTOUPDATE@|$BUILD/tools/kytoupdate|" \
     "$HERE/page-nginx.conf.in" >$STATE/nginx.conf
 nginx -e $STATE/error.log -c $STATE/nginx.conf
