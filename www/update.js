@@ -55,11 +55,9 @@ function itemsText(s, words, vyx, progress) {
 
 function applyText(s) {
   const a = s.apply;
-  if (a.stage === "none") {
-    return s.downloaded === "vyxupdate"
-      ? "The downloaded release is installed by the installer, not from this page."
-      : "Not applied.";
-  }
+  if (s.downloaded === "vyxupdate")
+    return "The downloaded release is installed by the installer, not from this page.";
+  if (a.stage === "none") return "Not applied.";
   if (a.stage === "reboot") return "Applied: restart the appliance to finish the update.";
   return a.stage + " " + a.percentage + "%" + (a.error ? " (error: " + a.error + ")" : "");
 }

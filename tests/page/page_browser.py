@@ -1,10 +1,11 @@
 #!/usr/bin/env python3
 """Drives the update page in headless Chromium through ChromeDriver's WebDriver HTTP API
 (standard library only) and fails on a script error or a wrong state.  One screenshot per
-step in OUT.   page_browser.py BASE_URL OUT_DIR"""
+step in OUT.  PUBLISH is a shell command that publishes release 5.2-5700 on the site.
+    page_browser.py BASE_URL OUT_DIR PUBLISH"""
 import base64, json, os, subprocess, sys, time, urllib.request
 
-BASE, OUT = sys.argv[1], sys.argv[2]
+BASE, OUT, PUBLISH = sys.argv[1], sys.argv[2], sys.argv[3]
 WD = "http://127.0.0.1:9515"
 
 
@@ -109,8 +110,23 @@ def run(p):
     p.wait("apply finished", lambda: "finish" in p.text("apply-state"), 30)
     assert not p.enabled("apply")
     p.shot("applied")
-    errors = p.errors()
-    assert not errors, "script errors: %s" % errors
+
+
+def release(p, publish):
+    """The vendor publishes a full release: offered, downloaded image by image, left to the
+    installer."""
+    subprocess.run(["bash", "-c", publish], check=True, stdout=subprocess.DEVNULL)
+    p.click("check")
+    p.wait("the release offered", lambda: p.text("offer") == "Full release: VYX 5.2-5700")
+    p.wait("download enabled", lambda: p.enabled("download"))
+    p.click("download")
+    p.wait("the image moving", lambda: p.text("download-state") == "downloading"
+           and p.text("items") == "(image 1 of 1)" and p.text("percent") not in ("0%", "100%"))
+    p.shot("release-downloading")
+    p.wait("downloaded", lambda: p.text("download-state") in ("downloaded", "failed"), 90)
+    assert p.text("download-state") == "downloaded", p.text("message")
+    assert not p.enabled("apply") and "installer" in p.text("apply-state"), p.text("apply-state")
+    p.shot("release-downloaded")
 
 
 def main():
@@ -126,6 +142,9 @@ def main():
         p = Page()
         try:
             run(p)
+            release(p, PUBLISH)
+            errors = p.errors()
+            assert not errors, "script errors: %s" % errors
         finally:
             print("browser errors:", p.errors())
             call("DELETE", p.s(""))

@@ -11,7 +11,7 @@ OUT=$BUILD/page-test
 if [ "${KYTO_IN_SANDBOX:-}" != 1 ]; then
     rm -rf "$OUT"
     mkdir -p "$OUT"
-    KYTO_IN_SANDBOX=1 KYTO_DEMO_PKG_RATE=${KYTO_DEMO_PKG_RATE:-150k} \
+    KYTO_IN_SANDBOX=1 KYTO_DEMO_PKG_RATE=${KYTO_DEMO_PKG_RATE:-150k} KYTO_DEMO_IMG_RATE=2m \
         "$BUILD/tests/kyto-sandbox" "$HERE/../../scripts/demo/appliance.sh" "$BUILD" --page \
         "$HERE/page_test.sh" "$BUILD" >"$OUT/appliance.log" 2>&1 || rc=$?
     # The sandbox's files vanish with it: the screenshots come out as a base64 tar.
@@ -61,7 +61,11 @@ SHOTS=/tmp/kyto-page-shots
 mkdir -p $SHOTS
 export HOME=/tmp
 rc=0
-python3 "$HERE/page_browser.py" $B $SHOTS || rc=$?
+# The release the browser test publishes half-way, signed with the demo's key.
+PUBLISH="head -c 8M /dev/urandom >/tmp/VYX_5.2-5700.img &&
+    $BUILD/tools/kytosite release /srv/kyto-demo /tmp/VYX_5.2-5700.img --version 5.2-5700 \
+        --model demo_model && $BUILD/tools/kytosite sign /srv/kyto-demo --key /tmp/kyto-demo/keys/demo.key"
+python3 "$HERE/page_browser.py" $B $SHOTS "$PUBLISH" || rc=$?
 if [ $rc -ne 0 ]; then
     echo "-- download.log"; cat /run/kyto-page/download.log
     echo "-- system log"; grep -h kytoupdate /var/log/sandbox.syslog | tail -n 15
