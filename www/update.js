@@ -26,8 +26,10 @@ function isError(end) {
     !(end.action === "download" && end.exit === 4);
 }
 
-// The check's answer "smallupdate VYX 5.2-5644 update 2" as kind and version.
-function offerText(check) {
+// The check's answer "smallupdate VYX 5.2-5644 update 2" as kind and version.  An apply
+// consumes the offer.
+function offerText(check, last) {
+  if (!check && last && last.action === "apply") return "Not checked since the last apply.";
   if (!check) return "Not checked yet.";
   if (check.exit !== 0) return check.words;
   const words = check.output.split(" ");
@@ -64,7 +66,7 @@ function applyText(s) {
 
 function render(data) {
   state.status = data;
-  el("offer").textContent = offerText(data.check);
+  el("offer").textContent = offerText(data.check, data.last);
   const s = data.status;
   if (!s) {
     showMessage(data.error || "The status could not be read.", true);

@@ -1,11 +1,12 @@
 #!/usr/bin/env python3
 """Drives the update page in headless Chromium through ChromeDriver's WebDriver HTTP API
 (standard library only) and fails on a script error or a wrong state.  One screenshot per
-step in OUT.  PUBLISH is a shell command that publishes release 5.2-5700 on the site.
-    page_browser.py BASE_URL OUT_DIR PUBLISH"""
+step in OUT.  PUBLISH... is a command that publishes on the site what one more argument
+names: "reboot-fix" (fix 3, which needs a reboot) or "release" (release 5.2-5700).
+    page_browser.py BASE_URL OUT_DIR PUBLISH..."""
 import base64, json, os, subprocess, sys, time, urllib.request
 
-BASE, OUT, PUBLISH = sys.argv[1], sys.argv[2], sys.argv[3]
+BASE, OUT, PUBLISH = sys.argv[1], sys.argv[2], sys.argv[3:]
 WD = "http://127.0.0.1:9515"
 
 
@@ -108,14 +109,37 @@ def run(p):
     p.click("apply")
     p.wait("small fix 2", lambda: p.text("smallfix") == "2", 90)
     p.wait("apply finished", lambda: "finish" in p.text("apply-state"), 30)
-    assert not p.enabled("apply")
+    assert not p.enabled("apply") and not p.enabled("download")
+    assert p.text("offer") == "Not checked since the last apply.", p.text("offer")
     p.shot("applied")
 
 
-def release(p, publish):
+def publish(what):
+    subprocess.run(PUBLISH + [what], check=True, stdout=subprocess.DEVNULL)
+
+
+def reboot_fix(p):
+    """The vendor publishes a fix that needs a reboot: once applied, the page asks for the
+    restart, and the new small-fix level is already recorded."""
+    publish("reboot-fix")
+    p.click("check")
+    p.wait("fix 3 offered", lambda: p.text("offer") == "Small update: VYX 5.2-5644 update 3")
+    p.wait("download enabled", lambda: p.enabled("download"))
+    p.click("download")
+    p.wait("downloaded", lambda: p.text("download-state") in ("downloaded", "failed"), 90)
+    assert p.text("download-state") == "downloaded", p.text("message")
+    p.wait("apply enabled", lambda: p.enabled("apply"))
+    p.click("apply")
+    p.wait("the restart asked for", lambda: "restart the appliance" in p.text("apply-state"), 60)
+    assert "reboot" in p.js("return document.getElementById('apply-state').className")
+    assert p.text("smallfix") == "3" and not p.enabled("apply"), p.text("smallfix")
+    p.shot("reboot-needed")
+
+
+def release(p):
     """The vendor publishes a full release: offered, downloaded image by image, left to the
     installer."""
-    subprocess.run(["bash", "-c", publish], check=True, stdout=subprocess.DEVNULL)
+    publish("release")
     p.click("check")
     p.wait("the release offered", lambda: p.text("offer") == "Full release: VYX 5.2-5700")
     p.wait("download enabled", lambda: p.enabled("download"))
@@ -142,7 +166,8 @@ def main():
         p = Page()
         try:
             run(p)
-            release(p, PUBLISH)
+            reboot_fix(p)
+            release(p)
             errors = p.errors()
             assert not errors, "script errors: %s" % errors
         finally:

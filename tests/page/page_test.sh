@@ -61,11 +61,8 @@ SHOTS=/tmp/kyto-page-shots
 mkdir -p $SHOTS
 export HOME=/tmp
 rc=0
-# The release the browser test publishes half-way, signed with the demo's key.
-PUBLISH="head -c 8M /dev/urandom >/tmp/VYX_5.2-5700.img &&
-    $BUILD/tools/kytosite release /srv/kyto-demo /tmp/VYX_5.2-5700.img --version 5.2-5700 \
-        --model demo_model && $BUILD/tools/kytosite sign /srv/kyto-demo --key /tmp/kyto-demo/keys/demo.key"
-python3 "$HERE/page_browser.py" $B $SHOTS "$PUBLISH" || rc=$?
+# The browser test publishes a fix and a release half-way, signed with the demo's key.
+python3 "$HERE/page_browser.py" $B $SHOTS "$HERE/page_publish.sh" "$BUILD" || rc=$?
 if [ $rc -ne 0 ]; then
     echo "-- download.log"; cat /run/kyto-page/download.log
     echo "-- system log"; grep -h kytoupdate /var/log/sandbox.syslog | tail -n 15
